@@ -1,0 +1,59 @@
+#ifndef BTBUS_SRC_CORE_CALL_H
+#define BTBUS_SRC_CORE_CALL_H
+
+#include <bluetooth/remote_object.h>
+
+#include "core/log.h"
+
+namespace Bluetooth {
+namespace internal {
+
+// One proxy operation: its method, whether it waits for the reply, and the line
+// its failure is logged at (pinned: it is part of the log's contract); kSilent
+// for an operation whose caller asked for no log line.
+enum { kSilent = 0 };
+struct Op {
+    const char* method;
+    bool wait;
+    int logLine;
+};
+
+// Output type of operations that read no reply.
+struct NoReply {};
+static NoReply* const kNoReply = 0;
+
+inline int appendAll(RemoteObject&) { return 0; }
+
+template <typename A, typename... Rest>
+int appendAll(RemoteObject& object, const A& first, const Rest&... rest) {
+    if (object.append(first) != 0) return -1;  // stops at the first failure
+    return appendAll(object, rest...);
+}
+
+inline int readReply(RemoteObject&, NoReply*) { return 0; }
+
+template <typename Out>
+int readReply(RemoteObject& object, Out* out) {
+    return object.getReplyValue(*out);
+}
+
+// The frame every proxy operation runs: reset the error state, build the call,
+// append the arguments, send it, read the reply if it waits for one, and log the
+// error text once. Returns 0, or the first failing step's result (-1, or -2
+// from an object-path reply that carried an error text).
+template <typename Out, typename... A>
+int call(RemoteObject& object, const char* file, const Op& op, Out* out, const A&... args) {
+    object.resetError();
+    int result = object.newMessage(op.method);
+    if (result == 0) result = appendAll(object, args...);
+    if (result == 0) result = object.sendMessage(op.wait, -1);
+    if (result == 0 && op.wait) result = readReply(object, out);
+    if (object.hasError() && op.logLine != kSilent)
+        logError(file, op.logLine, "%s", object.getErrorMessage().c_str());
+    return result;
+}
+
+}  // namespace internal
+}  // namespace Bluetooth
+
+#endif

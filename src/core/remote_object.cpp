@@ -1,0 +1,912 @@
+#include <bluetooth/remote_object.h>
+
+#include <atomic>
+#include <cerrno>
+#include <csignal>
+#include <cstdio>
+#include <iostream>
+#include <mutex>
+#include <sstream>
+
+#include <fcntl.h>
+#include <poll.h>
+#include <sched.h>
+#include <unistd.h>
+
+#include <bluetooth/connection.h>
+
+#include "core/dbus_holders.h"
+#include "core/log.h"
+#include "core/loop_flags.h"
+
+BT_LOG_FILE("remote_object.cpp");
+
+namespace Bluetooth {
+
+std::list<SignalHandler<SignalFunctionNoArgument> > RemoteObject::signalHandlerVectorNoArgument;
+std::list<SignalHandler<SignalFunctionString> > RemoteObject::signalHandlerVectorString;
+std::list<SignalHandler<SignalFunctionObjectPath> > RemoteObject::signalHandlerVectorObjectPath;
+std::list<SignalHandler<SignalFunctionStringVariant> >
+    RemoteObject::signalHandlerVectorStringVariant;
+std::list<SignalHandler<SignalFunctionStringDict> > RemoteObject::signalHandlerVectorStringDict;
+
+namespace {
+
+using internal::MessagePtr;
+using internal::ScopedError;
+
+// Written by signal handlers and other threads, read by waiting loops.
+enum { kInterrupted, kReplyArrived, kStop };
+volatile sig_atomic_t gFlags[3] = { 0, 0, 0 };
+
+const char* const kErrorTexts[] = {
+    "",
+    "Parameter is null",
+    "Reply message is null",
+    "Invalid path",
+    "Invalid reply value",
+    "Invalid reply format",
+    "Failed to create message",
+    "Failed to append args to message",
+    "Failed to append args = iterator",
+    "Failed to open container",
+    "Failed to send message",
+};
+const int kTextErrors = sizeof kErrorTexts / sizeof kErrorTexts[0];
+const int kBusError = 11;
+
+const char* orEmpty(const char* text) { return text ? text : ""; }
+
+// ---- receiving loop state, one per connection on which a loop was started ----
+
+struct LoopState {
+    DBusConnection* connection;
+    // The object whose loop last started here: the dispatching object for
+    // signals dispatched by a thread that is not a receiving thread (a thread
+    // waiting in sendMessagePending, say).
+    std::atomic<RemoteObject*> owner;
+    int wake[2];  // written when messages are queued or the loops must stop
+};
+
+std::mutex gLoopsLock;
+std::vector<LoopState*> gLoops;  // never freed: shared connections live as long
+
+// The receiving thread's own object; null on other threads.
+thread_local RemoteObject* tDispatching = 0;
+
+void wake(LoopState* state) {
+    char byte = 1;
+    ssize_t written = write(state->wake[1], &byte, 1);
+    (void)written;  // a full pipe already wakes the loop
+}
+
+void drain(int fd) {
+    char buffer[64];
+    while (read(fd, buffer, sizeof buffer) > 0) {
+    }
+}
+
+// Messages can be queued by another thread's I/O (a blocking call reads the
+// signals that arrive with its reply); this wakes the loop for them.
+void onDispatchStatus(DBusConnection*, DBusDispatchStatus status, void* data) {
+    if (status == DBUS_DISPATCH_DATA_REMAINS) wake(static_cast<LoopState*>(data));
+}
+
+void offerSignal(RemoteObject* object, DBusMessage* message) {
+    RemoteObject::signalHandlerDispatcherObjectPath(object, message);
+    RemoteObject::signalHandlerDispatcherStringVariant(object, message);
+    RemoteObject::signalHandlerDispatcherString(object, message);
+    RemoteObject::signalHandlerDispatcherStringDict(object, message);
+    RemoteObject::signalHandlerDispatcherNoArgument(object, message);
+}
+
+// Every message is left unhandled so that other filters, pending calls and
+// registered object paths still see it.
+DBusHandlerResult signalFilter(DBusConnection*, DBusMessage* message, void* data) {
+    if (dbus_message_get_type(message) != DBUS_MESSAGE_TYPE_SIGNAL)
+        return DBUS_HANDLER_RESULT_NOT_YET_HANDLED;
+    RemoteObject* object = tDispatching;
+    if (object == 0) object = static_cast<LoopState*>(data)->owner.load();
+    if (object != 0) offerSignal(object, message);
+    return DBUS_HANDLER_RESULT_NOT_YET_HANDLED;
+}
+
+LoopState* findLoop(DBusConnection* connection) {
+    for (size_t i = 0; i < gLoops.size(); ++i)
+        if (gLoops[i]->connection == connection) return gLoops[i];
+    return 0;
+}
+
+LoopState* prepareLoop(DBusConnection* connection, RemoteObject* owner) {
+    std::lock_guard<std::mutex> lock(gLoopsLock);
+    LoopState* state = findLoop(connection);
+    if (state == 0) {
+        state = new LoopState;
+        state->connection = connection;
+        if (pipe2(state->wake, O_NONBLOCK | O_CLOEXEC) != 0) {
+            BT_LOG_ERR("Failed to create wake-up pipe (%d)", errno);
+            state->wake[0] = state->wake[1] = -1;
+        }
+        // libdbus would otherwise _exit() the process when the bus goes away
+        // while this loop dispatches.
+        dbus_connection_set_exit_on_disconnect(connection, FALSE);
+        dbus_connection_add_filter(connection, &signalFilter, state, 0);
+        if (state->wake[1] >= 0)
+            dbus_connection_set_dispatch_status_function(connection, &onDispatchStatus, state, 0);
+        gLoops.push_back(state);
+    }
+    state->owner.store(owner);
+    return state;
+}
+
+void forgetLoopOwner(RemoteObject* object) {
+    std::lock_guard<std::mutex> lock(gLoopsLock);
+    for (size_t i = 0; i < gLoops.size(); ++i) {
+        RemoteObject* expected = object;
+        gLoops[i]->owner.compare_exchange_strong(expected, 0);
+    }
+}
+
+void wakeAllLoops() {
+    std::lock_guard<std::mutex> lock(gLoopsLock);
+    for (size_t i = 0; i < gLoops.size(); ++i)
+        if (gLoops[i]->wake[1] >= 0) wake(gLoops[i]);
+}
+
+// Waits outside libdbus, so that other threads' blocking calls keep the I/O path.
+void waitReadable(DBusConnection* connection, LoopState* state, int milliseconds) {
+    struct pollfd fds[2];
+    int count = 0;
+    int fd = -1;
+    if (dbus_connection_get_unix_fd(connection, &fd)) {
+        fds[count].fd = fd;
+        fds[count].events = POLLIN;
+        ++count;
+    }
+    if (state != 0 && state->wake[0] >= 0) {
+        fds[count].fd = state->wake[0];
+        fds[count].events = POLLIN;
+        ++count;
+    }
+    if (count == 0) {
+        usleep(milliseconds * 1000);
+        return;
+    }
+    if (poll(fds, count, milliseconds) > 0 && state != 0 && state->wake[0] >= 0) drain(state->wake[0]);
+}
+
+// ---- pending calls ----
+
+struct PendingState {
+    RemoteObject* object;
+    std::atomic<bool> claimed;  // the reply is taken once, by the notify or by the waiter
+};
+
+void onInterrupt(int) { gFlags[kInterrupted] = 1; }
+
+void installInterruptHandlers() {
+    struct sigaction action;
+    action.sa_handler = &onInterrupt;
+    sigemptyset(&action.sa_mask);
+    action.sa_flags = SA_NOCLDSTOP;
+    sigaction(SIGTERM, &action, 0);
+    sigaction(SIGINT, &action, 0);
+}
+
+void freePendingState(void* data) { delete static_cast<PendingState*>(data); }
+
+// ---- reading replies ----
+
+int basicTypeOf(DBusMessageIter& iterator) { return dbus_message_iter_get_arg_type(&iterator); }
+
+bool isText(int type) {
+    return type == DBUS_TYPE_STRING || type == DBUS_TYPE_OBJECT_PATH || type == DBUS_TYPE_SIGNATURE;
+}
+
+const char* readText(DBusMessageIter& iterator) {
+    const char* text = "";
+    dbus_message_iter_get_basic(&iterator, &text);
+    return text;
+}
+
+// Reads an array of texts. The element type is checked before any element is
+// read, because reading a number as a text would crash.
+bool readTexts(DBusMessageIter& array, std::vector<std::string>& values) {
+    DBusMessageIter element;
+    dbus_message_iter_recurse(&array, &element);
+    int type = basicTypeOf(element);
+    if (type != DBUS_TYPE_INVALID && !isText(type)) return false;
+    for (; basicTypeOf(element) != DBUS_TYPE_INVALID; dbus_message_iter_next(&element))
+        values.push_back(readText(element));
+    return true;
+}
+
+}  // namespace
+
+// ---- construction and access ----
+
+RemoteObject::RemoteObject(const char* destination, const char* path, const char* interface,
+                           DBusBusType busType)
+    : destination(orEmpty(destination)),
+      path(orEmpty(path)),
+      interface(orEmpty(interface)),
+      connection(0),
+      message(0),
+      reply(0),
+      busType(busType),
+      thread(),
+      errorNumber(0),
+      errorMessage() {
+    connection = Connection::get(busType);
+}
+
+RemoteObject::~RemoteObject() {
+    removeSignalHandlers(signalHandlerVectorNoArgument);
+    removeSignalHandlers(signalHandlerVectorString);
+    removeSignalHandlers(signalHandlerVectorObjectPath);
+    removeSignalHandlers(signalHandlerVectorStringVariant);
+    removeSignalHandlers(signalHandlerVectorStringDict);
+    forgetLoopOwner(this);
+    releaseReply();
+    releaseMessage();
+    if (connection != 0) Connection::unref(connection);
+}
+
+DBusConnection* RemoteObject::getConnection() const { return connection; }
+
+const char* RemoteObject::getConnectionName() const {
+    if (connection == 0) return "";
+    return orEmpty(dbus_bus_get_unique_name(connection));
+}
+
+const char* RemoteObject::getDestination() const { return destination.c_str(); }
+const char* RemoteObject::getPath() const { return path.c_str(); }
+const char* RemoteObject::getInterface() const { return interface.c_str(); }
+
+std::string RemoteObject::getInfo() const {
+    return "RemoteObject name: " + destination + "\nPath: " + path + "\nInterface: " + interface +
+           "\n";
+}
+
+int RemoteObject::printInfo() const {
+    std::cout << getInfo();
+    return 0;
+}
+
+// ---- error state ----
+
+int RemoteObject::fail(int number, const char* text) {
+    errorNumber = number;
+    if (text != 0) errorMessage = text;
+    return -1;
+}
+
+void RemoteObject::resetError() {
+    errorNumber = 0;
+    errorMessage.clear();
+}
+
+bool RemoteObject::hasError() const { return errorNumber != 0; }
+
+int RemoteObject::getErrorNumber() const { return errorNumber; }
+
+std::string RemoteObject::getErrorMessage() {
+    if (errorNumber == 0 || errorNumber == kBusError) return errorMessage;
+    if (errorNumber > 0 && errorNumber < kTextErrors)
+        errorMessage = kErrorTexts[errorNumber];
+    else
+        errorMessage = "Unknown error";
+    return errorMessage;
+}
+
+// ---- building a call ----
+
+int RemoteObject::newMessage(const char* method) {
+    if (method == 0) return fail(1);
+    releaseMessage();
+    // libdbus aborts the process on names it considers invalid, so they are
+    // checked here and reported like any other failure to create the call.
+    if (!dbus_validate_bus_name(destination.c_str(), 0) || !dbus_validate_path(path.c_str(), 0) ||
+        !dbus_validate_interface(interface.c_str(), 0) || !dbus_validate_member(method, 0))
+        return fail(6);
+    message = dbus_message_new_method_call(destination.c_str(), path.c_str(), interface.c_str(),
+                                           method);
+    return message != 0 ? 0 : fail(6);
+}
+
+int RemoteObject::append(bool value) {
+    dbus_bool_t truth = value ? TRUE : FALSE;
+    if (message == 0 || !dbus_message_append_args(message, DBUS_TYPE_BOOLEAN, &truth, DBUS_TYPE_INVALID))
+        return fail(7);
+    return 0;
+}
+
+int RemoteObject::append(const char* value) {
+    if (value == 0) return fail(1);
+    if (message == 0 || !dbus_validate_utf8(value, 0) ||
+        !dbus_message_append_args(message, DBUS_TYPE_STRING, &value, DBUS_TYPE_INVALID))
+        return fail(7);
+    return 0;
+}
+
+int RemoteObject::append(const ObjectPath& objectPath) {
+    const char* text = objectPath.c_str();
+    if (text[0] != '/') return fail(3);
+    if (message == 0 || !dbus_validate_path(text, 0) ||
+        !dbus_message_append_args(message, DBUS_TYPE_OBJECT_PATH, &text, DBUS_TYPE_INVALID))
+        return fail(7);
+    return 0;
+}
+
+int RemoteObject::append(unsigned int value) {
+    dbus_uint32_t number = value;
+    if (message == 0 || !dbus_message_append_args(message, DBUS_TYPE_UINT32, &number, DBUS_TYPE_INVALID))
+        return fail(7);
+    return 0;
+}
+
+int RemoteObject::append(unsigned short value) {
+    dbus_uint16_t number = value;
+    if (message == 0 || !dbus_message_append_args(message, DBUS_TYPE_UINT16, &number, DBUS_TYPE_INVALID))
+        return fail(7);
+    return 0;
+}
+
+int RemoteObject::append(const Variant& value) {
+    static const char* const kSignatures[] = { "u", "q", "b", "s" };
+    // Lists and signed numbers have no signature to write; libdbus would abort
+    // on an empty one, so no container is opened for them.
+    if (value.which() > 3 || message == 0) return fail(9);
+    DBusMessageIter arguments;
+    dbus_message_iter_init_append(message, &arguments);
+    internal::OpenContainer variant(arguments, DBUS_TYPE_VARIANT, kSignatures[value.which()]);
+    if (!variant.isOpen()) return fail(9);
+    bool appended = false;
+    switch (value.which()) {
+    case 0: {
+        dbus_uint32_t number = boost::get<unsigned int>(value);
+        appended = dbus_message_iter_append_basic(variant.iterator(), DBUS_TYPE_UINT32, &number);
+        break;
+    }
+    case 1: {
+        dbus_uint16_t number = boost::get<unsigned short>(value);
+        appended = dbus_message_iter_append_basic(variant.iterator(), DBUS_TYPE_UINT16, &number);
+        break;
+    }
+    case 2: {
+        dbus_bool_t truth = boost::get<bool>(value) ? TRUE : FALSE;
+        appended = dbus_message_iter_append_basic(variant.iterator(), DBUS_TYPE_BOOLEAN, &truth);
+        break;
+    }
+    default: {
+        const char* text = boost::get<std::string>(value).c_str();
+        appended = dbus_validate_utf8(text, 0) &&
+                   dbus_message_iter_append_basic(variant.iterator(), DBUS_TYPE_STRING, &text);
+        break;
+    }
+    }
+    if (!appended) return fail(8);  // the holder abandons the container
+    return variant.close() ? 0 : fail(9);
+}
+
+void RemoteObject::releaseMessage() {
+    if (message != 0) dbus_message_unref(message);
+    message = 0;
+}
+
+void RemoteObject::releaseReply() {
+    if (reply != 0) dbus_message_unref(reply);
+    reply = 0;
+}
+
+// ---- sending ----
+
+int RemoteObject::sendMessage(bool waitReply, int timeout) {
+    releaseReply();
+    ScopedError error;
+    int result = 0;
+    if (connection == 0 || message == 0) {
+        const char* why = connection == 0 ? "No connection to the bus" : "No message to send";
+        result = waitReply ? fail(kBusError, why) : fail(10);
+    } else if (waitReply) {
+        // libdbus aborts on a time-out below -1; those mean its default as well.
+        reply = dbus_connection_send_with_reply_and_block(connection, message,
+                                                          timeout < -1 ? -1 : timeout, error.get());
+        if (reply == 0) result = fail(kBusError, error.text());
+    } else {
+        dbus_message_set_no_reply(message, TRUE);
+        // A closed connection would accept the message and drop it silently.
+        if (!dbus_connection_get_is_connected(connection) ||
+            !dbus_connection_send(connection, message, 0))
+            result = fail(10);
+        else
+            dbus_connection_flush(connection);
+    }
+    releaseMessage();
+    return result;
+}
+
+int RemoteObject::setReplyMessage(DBusMessage* newReply) {
+    if (newReply == 0) return fail(2);
+    releaseReply();
+    reply = newReply;
+    return 0;
+}
+
+namespace {
+
+// Runs on whichever thread dispatches the reply.
+void onPendingReply(DBusPendingCall* pending, void* data) {
+    PendingState* state = static_cast<PendingState*>(data);
+    if (state->claimed.exchange(true)) return;
+    state->object->setReplyMessage(dbus_pending_call_steal_reply(pending));
+    gFlags[kReplyArrived] = 1;
+}
+
+}  // namespace
+
+int RemoteObject::sendMessagePending() {
+    ScopedError error;
+    releaseReply();
+    int result = 0;
+    DBusPendingCall* pending = 0;
+    if (connection == 0 || message == 0) {
+        result = fail(kBusError, connection == 0 ? "No connection to the bus" : "No message to send");
+    } else if (!dbus_connection_send_with_reply(connection, message, &pending, -1)) {
+        result = fail(kBusError, error.text());  // libdbus sets no error text here
+    } else {
+        PendingState* state = 0;
+        if (pending != 0) {
+            state = new PendingState;
+            state->object = this;
+            state->claimed = false;
+            dbus_pending_call_set_notify(pending, &onPendingReply, state,
+                                         &freePendingState);
+            // Another thread may have dispatched the reply before the notify was set.
+            if (dbus_pending_call_get_completed(pending)) onPendingReply(pending, state);
+        }
+        dbus_connection_flush(connection);
+        installInterruptHandlers();
+        while (!gFlags[kInterrupted] && !gFlags[kReplyArrived]) {
+            if (!dbus_connection_read_write_dispatch(connection, 500)) break;
+        }
+        if (pending != 0) {
+            // Claim the reply so that a late notify cannot touch this object after
+            // the call returned; if the notify is running, let it finish.
+            if (state->claimed.exchange(true)) {
+                while (!gFlags[kReplyArrived]) sched_yield();
+            } else {
+                dbus_pending_call_cancel(pending);
+            }
+            dbus_pending_call_unref(pending);
+        }
+    }
+    releaseMessage();
+    gFlags[kInterrupted] = 0;
+    gFlags[kReplyArrived] = 0;
+    return result;
+}
+
+// ---- reading replies ----
+
+bool RemoteObject::takeReply(DBusMessage*& holder, DBusMessageIter& iterator) {
+    if (reply == 0) {
+        fail(2);
+        return false;
+    }
+    holder = reply;
+    reply = 0;
+    dbus_message_iter_init(holder, &iterator);
+    return true;
+}
+
+int RemoteObject::getReplyValue(std::string& value) {
+    DBusMessage* taken = 0;
+    DBusMessageIter arguments;
+    if (!takeReply(taken, arguments)) return -1;
+    MessagePtr hold(taken);
+    if (basicTypeOf(arguments) != DBUS_TYPE_STRING) return fail(4);
+    value = readText(arguments);
+    return 0;
+}
+
+int RemoteObject::getReplyValue(bool& value) {
+    DBusMessage* taken = 0;
+    DBusMessageIter arguments;
+    if (!takeReply(taken, arguments)) return -1;
+    MessagePtr hold(taken);
+    if (basicTypeOf(arguments) != DBUS_TYPE_BOOLEAN) return fail(4);
+    dbus_bool_t truth = FALSE;
+    dbus_message_iter_get_basic(&arguments, &truth);
+    value = truth != 0;
+    return 0;
+}
+
+int RemoteObject::getReplyValue(ObjectPath& value) {
+    DBusMessage* taken = 0;
+    DBusMessageIter arguments;
+    if (!takeReply(taken, arguments)) return -1;
+    MessagePtr hold(taken);
+    int type = basicTypeOf(arguments);
+    if (type == DBUS_TYPE_OBJECT_PATH) {
+        value = ObjectPath(readText(arguments));
+        return 0;
+    }
+    // Unlike the other readers: error 11 with the text unchanged, and -2 with the
+    // peer's text for a string, which is how an error reply arrives here.
+    errorNumber = kBusError;
+    if (type != DBUS_TYPE_STRING) return -1;
+    value = ObjectPath(readText(arguments));
+    errorMessage = value.str();
+    return -2;
+}
+
+int RemoteObject::readStringArray(std::vector<std::string>& values) {
+    DBusMessage* taken = 0;
+    DBusMessageIter arguments;
+    if (!takeReply(taken, arguments)) return -1;
+    MessagePtr hold(taken);
+    if (basicTypeOf(arguments) != DBUS_TYPE_ARRAY) return fail(4);
+    values.clear();
+    return readTexts(arguments, values) ? 0 : fail(4);
+}
+
+int RemoteObject::getReplyValue(std::vector<std::string>& values) { return readStringArray(values); }
+
+int RemoteObject::getReplyValue(std::vector<ObjectPath>& values) {
+    std::vector<std::string> texts;
+    int result = readStringArray(texts);
+    if (result == 0) values.clear();
+    for (size_t i = 0; i < texts.size(); ++i) values.push_back(ObjectPath(texts[i]));
+    return result;
+}
+
+int RemoteObject::getReplyValue(Dict& dict) {
+    DBusMessage* taken = 0;
+    DBusMessageIter arguments;
+    if (!takeReply(taken, arguments)) return -1;
+    MessagePtr hold(taken);
+    if (basicTypeOf(arguments) != DBUS_TYPE_ARRAY ||
+        dbus_message_iter_get_element_type(&arguments) != DBUS_TYPE_DICT_ENTRY)
+        return fail(5);
+    dict.clear();
+    DBusMessageIter array;
+    dbus_message_iter_recurse(&arguments, &array);
+    for (; basicTypeOf(array) == DBUS_TYPE_DICT_ENTRY; dbus_message_iter_next(&array)) {
+        DBusMessageIter field;
+        dbus_message_iter_recurse(&array, &field);
+        Entry entry;
+        if (parseEntryName(field, entry) != 0) return -1;
+        if (entry.first.empty()) return 0;  // ends the dictionary, on purpose
+        dbus_message_iter_next(&field);
+        if (parseEntryValue(field, entry) != 0) return -1;
+        dict.push_back(entry);
+    }
+    return 0;
+}
+
+int RemoteObject::parseEntryName(DBusMessageIter& iterator, Entry& entry) {
+    int type = basicTypeOf(iterator);
+    if (type == DBUS_TYPE_STRING) {
+        entry.first = readText(iterator);
+        return 0;
+    }
+    if (type == DBUS_TYPE_UINT32) {
+        dbus_uint32_t number = 0;
+        dbus_message_iter_get_basic(&iterator, &number);
+        std::ostringstream text;
+        text << number;
+        entry.first = text.str();
+        return 0;
+    }
+    return fail(4);
+}
+
+int RemoteObject::parseEntryValue(DBusMessageIter& iterator, Entry& entry) {
+    int type = basicTypeOf(iterator);
+    if (type == DBUS_TYPE_STRING) {
+        entry.second = std::string(readText(iterator));
+        return 0;
+    }
+    if (type != DBUS_TYPE_VARIANT) return fail(4);
+    DBusMessageIter inner;
+    dbus_message_iter_recurse(&iterator, &inner);
+    switch (basicTypeOf(inner)) {
+    case DBUS_TYPE_UINT32: {
+        dbus_uint32_t number = 0;
+        dbus_message_iter_get_basic(&inner, &number);
+        entry.second = static_cast<unsigned int>(number);
+        return 0;
+    }
+    case DBUS_TYPE_UINT16: {
+        dbus_uint16_t number = 0;
+        dbus_message_iter_get_basic(&inner, &number);
+        entry.second = static_cast<unsigned short>(number);
+        return 0;
+    }
+    case DBUS_TYPE_BOOLEAN: {
+        dbus_bool_t truth = FALSE;
+        dbus_message_iter_get_basic(&inner, &truth);
+        entry.second = truth != 0;
+        return 0;
+    }
+    case DBUS_TYPE_STRING:
+    case DBUS_TYPE_OBJECT_PATH:
+        entry.second = std::string(readText(inner));
+        return 0;
+    case DBUS_TYPE_INT16: {
+        dbus_int16_t number = 0;
+        dbus_message_iter_get_basic(&inner, &number);
+        entry.second = static_cast<int>(number);
+        return 0;
+    }
+    case DBUS_TYPE_ARRAY: {
+        std::vector<std::string> texts;
+        DBusMessageIter element;
+        dbus_message_iter_recurse(&inner, &element);
+        int elementType = basicTypeOf(element);
+        if (elementType != DBUS_TYPE_INVALID && elementType != DBUS_TYPE_STRING &&
+            elementType != DBUS_TYPE_OBJECT_PATH)
+            return fail(4);
+        readTexts(inner, texts);
+        entry.second = texts;
+        return 0;
+    }
+    default:
+        return fail(4);
+    }
+}
+
+// ---- signals ----
+
+std::string RemoteObject::matchRule(const std::string& signalName) const {
+    return "type='signal',interface='" + interface + "',member='" + signalName + "',path='" + path +
+           "'";
+}
+
+template <typename F>
+int RemoteObject::addSignalHandler(std::list<SignalHandler<F> >& list, const char* signalName,
+                                   F function) {
+    if (signalName == 0) {
+        BT_LOG_ERR("Match error (%s)", "no signal name");
+        return -1;
+    }
+    if (connection == 0) {
+        BT_LOG_ERR("Match error (%s)", "no connection to the bus");
+        return -1;
+    }
+    ScopedError error;
+    std::string rule = matchRule(signalName);
+    dbus_bus_add_match(connection, rule.c_str(), error.get());
+    dbus_connection_flush(connection);
+    if (error.isSet()) {
+        BT_LOG_ERR("Match error (%s)", error.text());
+        return -1;
+    }
+    list.push_back(SignalHandler<F>(this, signalName, function));
+    return 0;
+}
+
+template <typename F>
+void RemoteObject::removeSignalHandlers(std::list<SignalHandler<F> >& list) {
+    typename std::list<SignalHandler<F> >::iterator it = list.begin();
+    while (it != list.end()) {
+        if (it->object != this) {
+            ++it;
+            continue;
+        }
+        if (connection != 0) {
+            ScopedError error;
+            dbus_bus_remove_match(connection, matchRule(it->signalName).c_str(), error.get());
+            if (error.isSet()) BT_LOG_ERR("Remove match error (%s)", error.text());
+        }
+        it = list.erase(it);
+    }
+}
+
+int RemoteObject::setSignalHandlerNoArgument(const char* signalName,
+                                             SignalFunctionNoArgument function) {
+    return addSignalHandler(signalHandlerVectorNoArgument, signalName, function);
+}
+
+int RemoteObject::setSignalHandlerString(const char* signalName, SignalFunctionString function) {
+    return addSignalHandler(signalHandlerVectorString, signalName, function);
+}
+
+int RemoteObject::setSignalHandlerObjectPath(const char* signalName,
+                                             SignalFunctionObjectPath function) {
+    return addSignalHandler(signalHandlerVectorObjectPath, signalName, function);
+}
+
+int RemoteObject::setSignalHandlerStringVariant(const char* signalName,
+                                                SignalFunctionStringVariant function) {
+    return addSignalHandler(signalHandlerVectorStringVariant, signalName, function);
+}
+
+int RemoteObject::setSignalHandlerStringDict(const char* signalName,
+                                             SignalFunctionStringDict function) {
+    return addSignalHandler(signalHandlerVectorStringDict, signalName, function);
+}
+
+namespace {
+
+// Walks a handler list, calling visit(handler) for every handler that matches
+// the signal; visit returns false to end the walk (a decoding failure). The
+// iterator moves on before the call, so a handler may unlink its own node.
+template <typename F, typename Visit>
+void forMatching(std::list<SignalHandler<F> >& list, DBusMessage* message, Visit visit) {
+    typename std::list<SignalHandler<F> >::iterator it = list.begin();
+    while (it != list.end()) {
+        typename std::list<SignalHandler<F> >::iterator current = it++;
+        if (!dbus_message_is_signal(message, current->object->getInterface(),
+                                    current->signalName.c_str()))
+            continue;
+        if (!visit(*current)) return;
+    }
+}
+
+// Opens the signal's arguments and checks that the first is of the given type,
+// logging why not.
+bool firstArgument(DBusMessage* message, DBusMessageIter& arguments, int type,
+                   const char* notThatType) {
+    if (!dbus_message_iter_init(message, &arguments)) {
+        BT_LOG_ERR("Signal has no arguments");
+        return false;
+    }
+    if (basicTypeOf(arguments) != type) {
+        BT_LOG_ERR("%s", notThatType);
+        return false;
+    }
+    return true;
+}
+
+const char kNotString[] = "Argument is not string";
+
+}  // namespace
+
+void RemoteObject::signalHandlerDispatcherObjectPath(RemoteObject*, DBusMessage* message) {
+    forMatching(signalHandlerVectorObjectPath, message,
+                [message](SignalHandler<SignalFunctionObjectPath>& handler) -> bool {
+                    DBusMessageIter arguments;
+                    if (!firstArgument(message, arguments, DBUS_TYPE_OBJECT_PATH,
+                                       "Argument is not object path"))
+                        return false;
+                    ObjectPath value(readText(arguments));
+                    handler.function(handler.object, &value);
+                    return true;
+                });
+}
+
+void RemoteObject::signalHandlerDispatcherString(RemoteObject*, DBusMessage* message) {
+    forMatching(signalHandlerVectorString, message,
+                [message](SignalHandler<SignalFunctionString>& handler) -> bool {
+                    DBusMessageIter arguments;
+                    if (!firstArgument(message, arguments, DBUS_TYPE_STRING, kNotString))
+                        return false;
+                    std::string text = readText(arguments);
+                    handler.function(handler.object, text.c_str());
+                    return true;
+                });
+}
+
+void RemoteObject::signalHandlerDispatcherStringVariant(RemoteObject* object, DBusMessage* message) {
+    forMatching(signalHandlerVectorStringVariant, message,
+                [object, message](SignalHandler<SignalFunctionStringVariant>& handler) -> bool {
+                    DBusMessageIter arguments;
+                    if (!firstArgument(message, arguments, DBUS_TYPE_STRING, kNotString))
+                        return false;
+                    Entry entry;
+                    if (object->parseEntryName(arguments, entry) != 0) {
+                        BT_LOG_ERR("Failed to parse string in signal");
+                        return false;
+                    }
+                    dbus_message_iter_next(&arguments);
+                    if (object->parseEntryValue(arguments, entry) != 0) {
+                        BT_LOG_ERR("Failed to parse variant in signal");
+                        return false;
+                    }
+                    handler.function(handler.object, entry.first.c_str(), &entry.second);
+                    return true;
+                });
+}
+
+void RemoteObject::signalHandlerDispatcherStringDict(RemoteObject* object, DBusMessage* message) {
+    forMatching(signalHandlerVectorStringDict, message,
+                [object, message](SignalHandler<SignalFunctionStringDict>& handler) -> bool {
+                    DBusMessageIter arguments;
+                    if (!firstArgument(message, arguments, DBUS_TYPE_STRING, kNotString))
+                        return false;
+                    std::string text = readText(arguments);
+                    dbus_message_iter_next(&arguments);
+                    if (basicTypeOf(arguments) != DBUS_TYPE_ARRAY ||
+                        dbus_message_iter_get_element_type(&arguments) != DBUS_TYPE_DICT_ENTRY) {
+                        BT_LOG_ERR("Argument is not dict");
+                        return false;
+                    }
+                    Dict dict;
+                    DBusMessageIter array;
+                    dbus_message_iter_recurse(&arguments, &array);
+                    for (; basicTypeOf(array) == DBUS_TYPE_DICT_ENTRY; dbus_message_iter_next(&array)) {
+                        DBusMessageIter field;
+                        dbus_message_iter_recurse(&array, &field);
+                        Entry entry;
+                        if (object->parseEntryName(field, entry) != 0) {
+                            BT_LOG_ERR("Failed to parse entry name");
+                            return false;
+                        }
+                        if (entry.first.empty()) break;  // drops the rest, as replies do
+                        dbus_message_iter_next(&field);
+                        if (object->parseEntryValue(field, entry) != 0) {
+                            BT_LOG_ERR("Failed to parse entry value");
+                            return false;
+                        }
+                        dict.push_back(entry);
+                    }
+                    handler.function(handler.object, text.c_str(), &dict);
+                    return true;
+                });
+}
+
+void RemoteObject::signalHandlerDispatcherNoArgument(RemoteObject* object, DBusMessage* message) {
+    // Called with the dispatching object, not the handler's own: deliberate.
+    forMatching(signalHandlerVectorNoArgument, message,
+                [object](SignalHandler<SignalFunctionNoArgument>& handler) -> bool {
+                    handler.function(object);
+                    return true;
+                });
+}
+
+// ---- receiving thread ----
+
+int RemoteObject::startLoop() {
+    if (connection != 0) prepareLoop(connection, this);
+    return pthread_create(&thread, 0, &receiveSignal, this);
+}
+
+void RemoteObject::stopLoop() {
+    gFlags[kStop] = 1;
+    wakeAllLoops();
+}
+
+int RemoteObject::waitLoop() {
+    if (pthread_equal(thread, pthread_t())) return ESRCH;  // never started, or joined already
+    int result = pthread_join(thread, 0);
+    thread = pthread_t();
+    return result;
+}
+
+void* receiveSignal(void* data) {
+    RemoteObject* object = static_cast<RemoteObject*>(data);
+    tDispatching = object;
+    DBusConnection* connection = object->connection;
+    LoopState* state = 0;
+    if (connection != 0) {
+        std::lock_guard<std::mutex> lock(gLoopsLock);
+        state = findLoop(connection);
+    }
+    while (!gFlags[kStop]) {
+        if (connection == 0 || !dbus_connection_get_is_connected(connection)) {
+            usleep(100000);
+            continue;
+        }
+        if (dbus_connection_get_dispatch_status(connection) == DBUS_DISPATCH_DATA_REMAINS) {
+            // Dispatching, rather than popping, lets every reply reach the call
+            // waiting for it and every method call reach its object path.
+            dbus_connection_dispatch(connection);
+            continue;
+        }
+        waitReadable(connection, state, 100);
+        dbus_connection_read_write(connection, 0);
+    }
+    tDispatching = 0;
+    return 0;
+}
+
+namespace internal {
+
+bool interruptedFlag() { return gFlags[kInterrupted] != 0; }
+bool replyArrivedFlag() { return gFlags[kReplyArrived] != 0; }
+
+}  // namespace internal
+
+}  // namespace Bluetooth

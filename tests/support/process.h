@@ -1,0 +1,50 @@
+#ifndef BTBUS_TESTS_SUPPORT_PROCESS_H
+#define BTBUS_TESTS_SUPPORT_PROCESS_H
+
+#include <chrono>
+#include <functional>
+#include <string>
+#include <vector>
+
+#include <dbus/dbus.h>
+#include <sys/types.h>
+
+namespace btbus_test {
+
+using namespace std::chrono_literals;
+
+// Debian's interpreter, which sees python3-dbus and python3-dbusmock; the
+// python3 first on PATH may not.
+constexpr const char* kDebianPython = "/usr/bin/python3";
+
+// Starts argv[0] (looked up on PATH) with argv; its standard output goes to a
+// pipe whose read end is stored in *stdoutFd when that is given. Fails the
+// current test and returns -1 if it cannot be started.
+pid_t spawn(const std::vector<std::string>& argv, int* stdoutFd = nullptr);
+
+// Sends signal to pid and reaps it, escalating to SIGKILL after grace.
+// Returns the wait status, or -1 if pid was not a child.
+int stop(pid_t pid, int signal = 15, std::chrono::milliseconds grace = 3000ms);
+
+// Reads one line from fd, waiting at most deadline; "" on time-out or end.
+std::string readLine(int fd, std::chrono::milliseconds deadline);
+
+// Polls predicate every 5 ms until it holds or deadline passes.
+bool waitUntil(const std::function<bool()>& predicate, std::chrono::milliseconds deadline = 3000ms);
+
+// Whether name has an owner on the bus, asked through a private connection so
+// that the library's shared connection is not touched.
+bool nameHasOwner(DBusBusType bus, const std::string& name);
+bool waitForName(DBusBusType bus, const std::string& name,
+                 std::chrono::milliseconds deadline = 10000ms);
+
+// Fails the test with a clear message when Debian's python3-dbusmock cannot be
+// imported by /usr/bin/python3.
+void requireDbusmock();
+
+// A directory for this test binary's files under the build tree's test-tmp.
+std::string scratchDir();
+
+}  // namespace btbus_test
+
+#endif
