@@ -77,6 +77,7 @@ REPLIES = {
 SIGNALS = {
     'path': (MAIN_OBJ, MAIN_IFACE, 'PathSignal', 'o', ['/org/btbus/Thing']),
     'string': (MAIN_OBJ, MAIN_IFACE, 'StringSignal', 's', ['text']),
+    'sentinel': (MAIN_OBJ, MAIN_IFACE, 'Sentinel', 's', ['done']),
     'variant': (MAIN_OBJ, MAIN_IFACE, 'PropertyChanged', 'sv', ['Powered', dbus.Boolean(True, variant_level=1)]),
     'variant-other-path': (OTHER_PATH, MAIN_IFACE, 'PropertyChanged', 'sv',
                            ['Alias', dbus.String('other', variant_level=1)]),
@@ -155,7 +156,7 @@ def load(mock, parameters):
     mock.AddMethod(MAIN_IFACE, 'LastAnswer', '', 's', lambda self: self.last_answer)
     mock.AddMethod(MAIN_IFACE, 'Emit', 's', '', emit_kind)
     mock.AddMethod(MAIN_IFACE, 'StartTicking', 'u', '', start_ticking)
-    mock.AddMethod(MAIN_IFACE, 'StopTicking', '', 'u', stop_ticking)
+    mock.AddMethod(MAIN_IFACE, 'StopTicking', '', 's', stop_ticking)
 
 
 def fail(self):
@@ -226,4 +227,4 @@ def stop_ticking(self):
     if self.ticker is not None:
         GLib.source_remove(self.ticker)
         self.ticker = None
-    return dbus.UInt32(self.ticks)
+    return str(self.ticks)

@@ -237,44 +237,6 @@ TEST_F(ARemoteObject, SendsNothingWhenAnArgumentCannotBeWritten) {
 
 // ---- pending calls ----
 
-struct CallbackState {
-    std::thread::id thread;
-    int calls = 0;
-};
-
-DBusHandlerResult answerPing(DBusConnection* connection, DBusMessage* message, void* data) {
-    if (!dbus_message_is_method_call(message, "org.btbus.Callback", "Ping"))
-        return DBUS_HANDLER_RESULT_NOT_YET_HANDLED;
-    auto* state = static_cast<CallbackState*>(data);
-    state->thread = std::this_thread::get_id();
-    ++state->calls;
-    const char* word = nullptr;
-    dbus_message_get_args(message, nullptr, DBUS_TYPE_STRING, &word, DBUS_TYPE_INVALID);
-    std::string answer = std::string("pong: ") + (word ? word : "");
-    const char* text = answer.c_str();
-    DBusMessage* reply = dbus_message_new_method_return(message);
-    dbus_message_append_args(reply, DBUS_TYPE_STRING, &text, DBUS_TYPE_INVALID);
-    dbus_connection_send(connection, reply, nullptr);
-    dbus_message_unref(reply);
-    return DBUS_HANDLER_RESULT_HANDLED;
-}
-
-// An object path served on the shared session connection, as an agent is.
-class ServedPath {
-public:
-    explicit ServedPath(RemoteObject& on) : connection_(on.getConnection()) {
-        vtable_.message_function = &answerPing;
-        EXPECT_TRUE(dbus_connection_register_object_path(connection_, kPath, &vtable_, &state));
-    }
-    ~ServedPath() { dbus_connection_unregister_object_path(connection_, kPath); }
-    static constexpr const char* kPath = "/org/btbus/Callback";
-    CallbackState state;
-
-private:
-    DBusConnection* connection_;
-    DBusObjectPathVTable vtable_{};
-};
-
 using APendingCall = PeerTest;
 
 TEST_F(APendingCall, ServesObjectPathsOnTheWaitingThreadUntilTheReplyArrives) {

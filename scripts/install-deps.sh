@@ -1,0 +1,29 @@
+#!/bin/sh
+# Installs the Debian packages that building and testing btbus need, when some
+# are missing. As root it runs apt-get; otherwise it prints the one line to run
+# and fails. Safe to run again: it does nothing when everything is there.
+set -eu
+
+PACKAGES="cmake make g++ pkg-config
+libdbus-1-dev dbus-daemon libdbus-glib-1-dev libglib2.0-dev libbluetooth-dev libboost-dev
+libgtest-dev libbenchmark-dev
+python3-dbus python3-gi python3-dbusmock libglib2.0-bin util-linux"
+
+missing=""
+for package in $PACKAGES; do
+    if ! dpkg-query -W -f='${Status}' "$package" 2>/dev/null | grep -q "install ok installed"; then
+        missing="$missing $package"
+    fi
+done
+[ -z "$missing" ] && exit 0
+
+if [ "$(id -u)" -ne 0 ]; then
+    echo "btbus needs these Debian packages; run as root:" >&2
+    echo "  apt-get install -y$missing" >&2
+    exit 1
+fi
+echo "installing:$missing"
+export DEBIAN_FRONTEND=noninteractive
+apt-get update -qq
+# shellcheck disable=SC2086
+apt-get install -y -qq $missing

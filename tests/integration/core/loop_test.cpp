@@ -1,0 +1,84 @@
+// The receiving thread beside the caller's thread on one shared connection.
+#include <atomic>
+
+#include <gtest/gtest.h>
+
+#include "integration/core/peer.h"
+
+using namespace Bluetooth;
+using namespace btbus_test;
+
+namespace {
+
+std::atomic<unsigned> gTicks{ 0 };
+void onTick(RemoteObject*, const char*) { ++gTicks; }
+
+class LoopTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        Peer::ensureStarted();
+        loopOwner();
+        peer = peerObject();
+    }
+    std::unique_ptr<RemoteObject> peer;
+};
+
+using TheReceivingThread = LoopTest;
+
+TEST_F(TheReceivingThread, LetsEveryBlockingCallHaveItsReplyWhileSignalsPourIn) {
+    ASSERT_EQ(peer->setSignalHandlerString("Tick", &onTick), 0);
+    gTicks = 0;
+    callPeer(*peer, "StartTicking", 1u);
+    for (int i = 0; i < 20000; ++i) {
+        std::string word = "call " + std::to_string(i);
+        ASSERT_EQ(peer->newMessage("Echo"), 0);
+        ASSERT_EQ(peer->append(word.c_str()), 0);
+        // A reply taken by the other thread shows as libdbus's 25 s time-out.
+        ASSERT_EQ(peer->sendMessage(true, -1), 0) << "call " << i << ": " << peer->getErrorMessage();
+        std::string echoed;
+        ASSERT_EQ(peer->getReplyValue(echoed), 0);
+        ASSERT_EQ(echoed, word);
+    }
+    callPeer(*peer, "StopTicking");
+    std::string emitted;
+    ASSERT_EQ(peer->getReplyValue(emitted), 0);
+    EXPECT_GT(std::stoul(emitted), 100u) << "the peer hardly ticked: the test proves little";
+    EXPECT_TRUE(waitUntil([&] { return gTicks == std::stoul(emitted); }))
+        << gTicks << " of " << emitted << " signals reached the handler";
+}
+
+TEST_F(TheReceivingThread, AnswersCallsToARegisteredObjectPath) {
+    ServedPath served(*peer);
+    callPeer(*peer, "CallBackLater", peer->getConnectionName(), ObjectPath(ServedPath::kPath));
+    // Only the receiving thread dispatches: this thread makes blocking calls.
+    std::string answer;
+    EXPECT_TRUE(waitUntil([&] {
+        callPeer(*peer, "LastAnswer");
+        return peer->getReplyValue(answer) == 0 && !answer.empty();
+    }));
+    EXPECT_EQ(answer, "pong: later");
+    EXPECT_EQ(served.state.calls.load(), 1);
+    EXPECT_NE(served.state.thread.load(), std::this_thread::get_id());
+}
+
+// Stopping is final for the whole process, so it runs in a child of its own.
+TEST(StoppingTheLoop, EndsEveryReceivingThreadAndThoseStartedLater) {
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    EXPECT_EXIT(
+        {
+            Peer::ensureStarted();
+            auto first = peerObject();
+            auto second = peerObject(kOtherPath);
+            if (first->startLoop() != 0 || second->startLoop() != 0) _exit(2);
+            first->stopLoop();
+            if (first->waitLoop() != 0 || second->waitLoop() != 0) _exit(3);
+            auto later = peerObject();
+            if (later->startLoop() != 0 || later->waitLoop() != 0) _exit(4);
+            // A wait for a thread that is not there fails instead of crashing.
+            if (later->waitLoop() == 0) _exit(5);
+            std::exit(0);
+        },
+        ::testing::ExitedWithCode(0), "");
+}
+
+}  // namespace
