@@ -23,9 +23,9 @@ protected:
     std::unique_ptr<RemoteObject> peer;
 };
 
-using TheReceivingThread = LoopTest;
+using TheReceivingThreadBesideCalls = LoopTest;
 
-TEST_F(TheReceivingThread, LetsEveryBlockingCallHaveItsReplyWhileSignalsPourIn) {
+TEST_F(TheReceivingThreadBesideCalls, LetsEveryBlockingCallHaveItsReplyWhileSignalsPourIn) {
     ASSERT_EQ(peer->setSignalHandlerString("Tick", &onTick), 0);
     gTicks = 0;
     callPeer(*peer, "StartTicking", 1u);
@@ -47,7 +47,7 @@ TEST_F(TheReceivingThread, LetsEveryBlockingCallHaveItsReplyWhileSignalsPourIn) 
         << gTicks << " of " << emitted << " signals reached the handler";
 }
 
-TEST_F(TheReceivingThread, AnswersCallsToARegisteredObjectPath) {
+TEST_F(TheReceivingThreadBesideCalls, AnswersCallsToARegisteredObjectPath) {
     ServedPath served(*peer);
     callPeer(*peer, "CallBackLater", peer->getConnectionName(), ObjectPath(ServedPath::kPath));
     // Only the receiving thread dispatches: this thread makes blocking calls.

@@ -1,0 +1,77 @@
+"""The launcher's process handling, and the template run directly by dbusmock."""
+
+import os
+import signal
+import subprocess
+import time
+import unittest
+
+import dbus
+import dbus.bus
+
+from simharness import PYTHON, LAUNCHER, Launcher, alive, children_of
+
+TEMPLATE = os.path.join(os.path.dirname(LAUNCHER), 'bluez4.py')
+
+
+def wait_for_bluez(address, proc, timeout=10):
+    bus = dbus.bus.BusConnection(address)
+    deadline = time.monotonic() + timeout
+    while not bus.name_has_owner('org.bluez'):
+        if proc.poll() is not None or time.monotonic() > deadline:
+            raise AssertionError('org.bluez did not appear')
+        time.sleep(0.02)
+    return bus
+
+
+def command_of(pid):
+    with open(f'/proc/{pid}/cmdline', 'rb') as f:
+        return f.read().split(b'\0')[0].decode()
+
+
+class LauncherTest(unittest.TestCase):
+
+    def test_sigterm_stops_everything_it_started(self):
+        launcher = Launcher()
+        children = children_of(launcher.proc.pid)
+        self.assertEqual(sorted(os.path.basename(command_of(pid)) for pid in children),
+                         ['dbus-daemon', 'dbus-daemon', 'python3'])
+        self.assertEqual(launcher.stop(), 0)
+        self.assertEqual([pid for pid in children if alive(pid)], [])
+
+    def test_sigint_too_and_env_buses_and_plain_dbusmock(self):
+        """A second simulator on the first one's session bus, via --use-env-buses and via dbusmock."""
+        host = Launcher()
+        try:
+            env = dict(os.environ, DBUS_SYSTEM_BUS_ADDRESS=host.env['DBUS_SESSION_BUS_ADDRESS'])
+            guest = Launcher('--use-env-buses', env=env)
+            self.assertEqual(guest.env, {})
+            bus = dbus.bus.BusConnection(host.env['DBUS_SESSION_BUS_ADDRESS'])
+            path = bus.call_blocking('org.bluez', '/', 'org.bluez.Manager', 'DefaultAdapter', '', ())
+            self.assertEqual(path, f'/org/bluez/{children_of(guest.proc.pid)[0]}/hci0')
+            bus.close()
+            guest.proc.send_signal(signal.SIGINT)
+            self.assertEqual(guest.stop(), 0)
+
+            mock = subprocess.Popen([PYTHON, '-m', 'dbusmock', '--system', '--template', TEMPLATE],
+                                    env=env, stdout=subprocess.DEVNULL)
+            try:
+                bus = wait_for_bluez(host.env['DBUS_SESSION_BUS_ADDRESS'], mock)
+                path = bus.call_blocking('org.bluez', '/', 'org.bluez.Manager', 'DefaultAdapter', '', ())
+                self.assertEqual(path, f'/org/bluez/{mock.pid}/hci0')
+                bus.close()
+            finally:
+                mock.terminate()
+                mock.wait(10)
+        finally:
+            host.stop()
+
+    def test_missing_scene_is_reported(self):
+        out = subprocess.run([LAUNCHER, '--scene', 'no-such-scene.json'], capture_output=True, text=True,
+                             timeout=20)
+        self.assertEqual(out.returncode, 2)
+        self.assertIn('cannot load scene', out.stderr)
+
+
+if __name__ == '__main__':
+    unittest.main()

@@ -1,0 +1,141 @@
+"""Pairing round trips with an agent exported by the test process."""
+
+import json
+import unittest
+
+import dbus
+
+from simharness import AsyncCall, SimTestCase, TestAgent, rejected, run_until
+
+ADAPTER = 'org.bluez.Adapter'
+PIN_DEVICE = {'address': '00:AA:00:00:00:01', 'name': 'Pin Kbd', 'legacy': True, 'pin': '8345'}
+SSP_DEVICE = {'address': '00:AA:00:00:00:02', 'name': 'Pad', 'io': 'DisplayYesNo', 'passkey': 271828}
+
+
+class PairingTest(SimTestCase):
+
+    def setUp(self):
+        super().setUp()
+        self.control('AddDevice', 'hci0', json.dumps(PIN_DEVICE))
+        self.control('AddDevice', 'hci0', json.dumps(SSP_DEVICE))
+        self.agent = TestAgent(self.bus, '/test/agent')
+        self.addCleanup(self.agent.remove_from_connection)
+
+    def pair(self, device, capability, timeout=10):
+        return AsyncCall(self.bus, self.adapter, ADAPTER, 'CreatePairedDevice', 'sos',
+                         [device['address'], self.agent.path, capability]).wait(timeout)
+
+    def assert_paired(self, call, device):
+        self.assertIsNone(call.error)
+        self.assertEqual(call.result, self.device_path(device['address']))
+        props = self.call(call.result, 'org.bluez.Device', 'GetProperties')
+        self.assertTrue(props['Paired'])
+        self.assertEqual(self.agent.members()[-1], 'Release')
+
+    def test_pin_code(self):
+        self.agent.answers['RequestPinCode'] = PIN_DEVICE['pin']
+        call = self.pair(PIN_DEVICE, 'DisplayYesNo')
+        self.assert_paired(call, PIN_DEVICE)
+        self.assertEqual(self.agent.calls[0], ('RequestPinCode', call.result))
+        self.drain()
+        members = [s[2] for s in self.signals]
+        self.assertEqual(members[:3], ['DeviceCreated', 'PropertyChanged', 'PropertyChanged'])
+        self.assertEqual(self.signals[2][3], ['Connected', True])
+        self.assertIn(['Paired', True], [s[3] for s in self.signals])
+
+    def test_wrong_pin_fails_and_removes_the_device(self):
+        self.agent.answers['RequestPinCode'] = PIN_DEVICE['pin'] + '9'
+        call = self.pair(PIN_DEVICE, 'DisplayYesNo')
+        self.assertEqual(call.error.get_dbus_name(), 'org.bluez.Error.AuthenticationFailed')
+        self.wait_signal('DeviceRemoved')
+
+    def test_passkey(self):
+        self.agent.answers['RequestPasskey'] = dbus.UInt32(SSP_DEVICE['passkey'])
+        call = self.pair(SSP_DEVICE, 'KeyboardOnly')
+        self.assert_paired(call, SSP_DEVICE)
+        self.assertEqual(self.agent.members(), ['RequestPasskey', 'Release'])
+
+    def test_confirmation_shows_the_device_passkey(self):
+        call = self.pair(SSP_DEVICE, 'DisplayYesNo')
+        self.assert_paired(call, SSP_DEVICE)
+        self.assertEqual(self.agent.calls[0], ('RequestConfirmation', call.result, SSP_DEVICE['passkey']))
+
+    def test_rejection_is_an_error(self):
+        self.agent.answers['RequestConfirmation'] = rejected()
+        call = self.pair(SSP_DEVICE, 'DisplayYesNo')
+        self.assertEqual(call.error.get_dbus_name(), 'org.bluez.Error.AuthenticationFailed')
+        self.assertTrue(self.run_until_agent('Release'))
+        self.assertEqual(self.agent.members(), ['RequestConfirmation', 'Release'])
+
+    def test_cancel_device_creation(self):
+        self.agent.answers['RequestPasskey'] = None  # the agent keeps the user thinking
+        call = AsyncCall(self.bus, self.adapter, ADAPTER, 'CreatePairedDevice', 'sos',
+                         [SSP_DEVICE['address'], self.agent.path, 'KeyboardOnly'])
+        self.assertTrue(self.run_until_agent('RequestPasskey'))
+        self.call(self.adapter, ADAPTER, 'CancelDeviceCreation', SSP_DEVICE['address'])
+        call.wait()
+        self.assertEqual(call.error.get_dbus_name(), 'org.bluez.Error.AuthenticationCanceled')
+        self.assertTrue(self.run_until_agent('Release'))
+        self.assertEqual(self.agent.members(), ['RequestPasskey', 'Cancel', 'Release'])
+        me = self.bus.get_unique_name()
+        dev = self.device_path(SSP_DEVICE['address'])
+        self.assertEqual(list(self.control('GetCallLog')), [
+            f'{self.adapter} org.bluez.Adapter.CreatePairedDevice({SSP_DEVICE["address"]}, /test/agent, KeyboardOnly)',
+            f'agent {me} /test/agent org.bluez.Agent.RequestPasskey({dev}) -> pending',
+            f'{self.adapter} org.bluez.Adapter.CancelDeviceCreation({SSP_DEVICE["address"]})',
+            f'agent {me} /test/agent org.bluez.Agent.Cancel() -> sent',
+            f'agent {me} /test/agent org.bluez.Agent.Release() -> sent'])
+
+    def test_call_log_shows_agent_answers(self):
+        self.agent.answers['RequestPinCode'] = PIN_DEVICE['pin']
+        call = self.pair(PIN_DEVICE, '')
+        log = list(self.control('GetCallLog'))
+        me = self.bus.get_unique_name()
+        self.assertEqual(log[1], f'agent {me} /test/agent org.bluez.Agent.RequestPinCode({call.result}) -> 8345')
+
+    def test_errors(self):
+        self.assert_error('org.bluez.Error.InvalidArguments', self.adapter, ADAPTER, 'CreatePairedDevice',
+                          '00:AA', dbus.ObjectPath('/a'), '')
+        self.assert_error('org.bluez.Error.InvalidArguments', self.adapter, ADAPTER, 'CreatePairedDevice',
+                          SSP_DEVICE['address'], dbus.ObjectPath('/a'), 'Telepathy')
+        far = AsyncCall(self.bus, self.adapter, ADAPTER, 'CreatePairedDevice', 'sos',
+                        ['00:24:7E:11:22:33', self.agent.path, '']).wait()
+        self.assertEqual(far.error.get_dbus_name(), 'org.bluez.Error.ConnectionAttemptFailed')
+        self.assertEqual(far.error.get_dbus_message(), 'Page Timeout')
+        self.assertEqual(AsyncCall(self.bus, self.adapter, ADAPTER, 'CreatePairedDevice', 'sos',
+                                   ['00:1F:20:AB:CD:EF', self.agent.path, '']).wait().error.get_dbus_name(),
+                         'org.bluez.Error.AlreadyExists')
+
+    def test_register_agent(self):
+        self.assertEqual(self.control('StartIncomingPairing', 'hci0', SSP_DEVICE['address']),
+                         'org.bluez.Error.AgentNotAvailable')
+        self.assert_error('org.bluez.Error.InvalidArguments', self.adapter, ADAPTER, 'RegisterAgent',
+                          dbus.ObjectPath(self.agent.path), 'Nope')
+        self.call(self.adapter, ADAPTER, 'RegisterAgent', dbus.ObjectPath(self.agent.path), 'DisplayYesNo')
+        self.assert_error('org.bluez.Error.AlreadyExists', self.adapter, ADAPTER, 'RegisterAgent',
+                          dbus.ObjectPath('/other'), '')
+        self.assert_error('org.bluez.Error.DoesNotExist', self.adapter, ADAPTER, 'UnregisterAgent',
+                          dbus.ObjectPath('/other'))
+        self.call(self.adapter, ADAPTER, 'UnregisterAgent', dbus.ObjectPath(self.agent.path))
+        self.assertTrue(self.run_until_agent('Release'))
+
+    def test_incoming_pairing_and_authorize(self):
+        self.call(self.adapter, ADAPTER, 'RegisterAgent', dbus.ObjectPath(self.agent.path), 'DisplayYesNo')
+        incoming = AsyncCall(self.bus, '/org/btbus/Simulator', 'org.btbus.Simulator', 'StartIncomingPairing',
+                             'ss', ['hci0', SSP_DEVICE['address']]).wait()
+        self.assertEqual(incoming.result, 'accepted')
+        self.assertEqual(self.agent.calls[0][0], 'RequestConfirmation')
+        self.agent.answers['Authorize'] = rejected()
+        auth = AsyncCall(self.bus, '/org/btbus/Simulator', 'org.btbus.Simulator', 'IncomingConnection',
+                         'sss', ['hci0', SSP_DEVICE['address'], '1105']).wait()
+        self.assertEqual(auth.result, 'org.bluez.Error.Rejected')
+        self.assertEqual(self.agent.calls[-1],
+                         ('Authorize', self.device_path(SSP_DEVICE['address']), '00001105-0000-1000-8000-00805f9b34fb'))
+        self.assertEqual(self.control('IncomingConnection', 'hci0', '00:1F:20:AB:CD:EF', '1124'), 'trusted')
+
+    def run_until_agent(self, member):
+        return run_until(lambda: member in self.agent.members(), 5)
+
+
+if __name__ == '__main__':
+    unittest.main()

@@ -1,0 +1,1 @@
+"""Simulated BlueZ 4 bluetoothd (see ../README.md)."""
