@@ -2,7 +2,7 @@
 BUILD ?= build
 JOBS ?= $(shell nproc)
 
-.PHONY: all deps configure build check demo sanitize install clean
+.PHONY: all deps configure build check demo bench sanitize clean
 
 all: build
 
@@ -22,6 +22,10 @@ check: build
 # Runs the main job against the BlueZ 4 simulator on private buses.
 demo: build
 	scripts/demo.sh $(BUILD)
+
+# Speed of the receiving loop against raw libdbus, measured in one run.
+bench: build
+	cd $(BUILD) && ./bench/btbus-bench-loop
 
 # The tests again, built with AddressSanitizer and UndefinedBehaviorSanitizer.
 sanitize: deps

@@ -153,26 +153,31 @@ void wakeAllLoops() {
         if (gLoops[i]->wake[1] >= 0) wake(gLoops[i]);
 }
 
-// Waits outside libdbus, so that other threads' blocking calls keep the I/O path.
-void waitReadable(DBusConnection* connection, LoopState* state, int milliseconds) {
+// Waits outside libdbus, so that other threads' blocking calls keep the I/O
+// path. Returns true when the socket became readable.
+bool waitReadable(DBusConnection* connection, LoopState* state, int milliseconds, bool socket) {
     struct pollfd fds[2];
     int count = 0;
     int fd = -1;
-    if (dbus_connection_get_unix_fd(connection, &fd)) {
-        fds[count].fd = fd;
-        fds[count].events = POLLIN;
-        ++count;
-    }
     if (state != 0 && state->wake[0] >= 0) {
         fds[count].fd = state->wake[0];
         fds[count].events = POLLIN;
+        fds[count].revents = 0;
+        ++count;
+    }
+    if (socket && dbus_connection_get_unix_fd(connection, &fd)) {
+        fds[count].fd = fd;
+        fds[count].events = POLLIN;
+        fds[count].revents = 0;
         ++count;
     }
     if (count == 0) {
         usleep(milliseconds * 1000);
-        return;
+        return false;
     }
-    if (poll(fds, count, milliseconds) > 0 && state != 0 && state->wake[0] >= 0) drain(state->wake[0]);
+    if (poll(fds, count, milliseconds) <= 0) return false;
+    if (state != 0 && state->wake[0] >= 0 && fds[0].revents != 0) drain(state->wake[0]);
+    return fd >= 0 && fds[count - 1].revents != 0;
 }
 
 // ---- pending calls ----
@@ -875,6 +880,11 @@ int RemoteObject::waitLoop() {
     return result;
 }
 
+namespace {
+// How long the loop leaves the socket to a thread that holds the I/O path.
+const int kBackOffMs = 2;
+}  // namespace
+
 void* receiveSignal(void* data) {
     RemoteObject* object = static_cast<RemoteObject*>(data);
     tDispatching = object;
@@ -895,8 +905,16 @@ void* receiveSignal(void* data) {
             dbus_connection_dispatch(connection);
             continue;
         }
-        waitReadable(connection, state, 100);
-        dbus_connection_read_write(connection, 0);
+        if (waitReadable(connection, state, 100, true)) {
+            dbus_connection_read_write(connection, 0);
+            // Data on the socket that this thread could not read: another thread
+            // holds the I/O path inside a blocking call and will read it. Rather
+            // than spin on the socket, wait for that thread to queue messages.
+            if (dbus_connection_get_dispatch_status(connection) == DBUS_DISPATCH_COMPLETE)
+                waitReadable(connection, state, kBackOffMs, false);
+        } else {
+            dbus_connection_read_write(connection, 0);
+        }
     }
     tDispatching = 0;
     return 0;
