@@ -1,0 +1,20 @@
+// A program of a library user: built as C++11 against the installed headers.
+#include <iostream>
+
+#include <bluetooth/btbus.h>
+
+int main() {
+    std::string separator = ";";
+    Bluetooth::Dict dict;
+    dict.push_back(Bluetooth::Entry("Class", Bluetooth::Variant(7936u)));
+    Bluetooth::Dict* back = Bluetooth::stringDivideToDict(Bluetooth::dictConquerToString(dict, separator), separator);
+    bool ok = back != 0 && back->size() == 1 && Bluetooth::find(back, "Class") == "7936";
+    delete back;
+
+    // No bus is reachable here: the object reports that through its error state.
+    Bluetooth::RemoteObject manager("org.bluez", "/", "org.bluez.Manager", DBUS_BUS_SYSTEM);
+    ok = ok && manager.newMessage("DefaultAdapter") == 0 && manager.sendMessage(true, -1) == -1 &&
+         manager.getErrorNumber() == 11;
+    std::cout << (ok ? "consumer ok" : "consumer FAILED") << std::endl;
+    return ok ? 0 : 1;
+}

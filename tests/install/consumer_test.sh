@@ -1,0 +1,31 @@
+#!/bin/sh
+# Installs the build into a private prefix, then builds and runs a C++11 user
+# program against it twice: through pkg-config and through the CMake package.
+# Usage: consumer_test.sh BUILD_DIR PREFIX CXX
+set -eu
+build=$1
+prefix=$2
+cxx=$3
+here=$(cd "$(dirname "$0")" && pwd)
+
+rm -rf "$prefix"
+cmake --install "$build" --prefix "$prefix" >/dev/null
+for header in connection object_path remote_object util variant btbus; do
+    test -f "$prefix/include/bluetooth/$header.h" || { echo "missing header $header.h"; exit 1; }
+done
+pc=$(find "$prefix" -name btbus.pc)
+test -n "$pc" || { echo "btbus.pc was not installed"; exit 1; }
+PKG_CONFIG_PATH=$(dirname "$pc")
+export PKG_CONFIG_PATH
+libdir=$(pkg-config --variable=libdir btbus)
+soname=$(readelf -d "$libdir/libbtbus.so" | sed -n 's/.*SONAME.*\[\(.*\)\]/\1/p')
+test "$soname" = libbtbus.so.0 || { echo "unexpected SONAME '$soname'"; exit 1; }
+
+# shellcheck disable=SC2046
+"$cxx" -std=c++11 -Wall -Wextra -Werror -o "$prefix/consumer" "$here/consumer.cpp" $(pkg-config --cflags --libs btbus)
+LD_LIBRARY_PATH=$libdir "$prefix/consumer"
+
+cmake -S "$here/cmake_consumer" -B "$prefix/cmake-consumer" -DCMAKE_PREFIX_PATH="$prefix" \
+      -DCMAKE_CXX_COMPILER="$cxx" >/dev/null
+cmake --build "$prefix/cmake-consumer" >/dev/null
+LD_LIBRARY_PATH=$libdir "$prefix/cmake-consumer/consumer"
