@@ -13,7 +13,7 @@ public:
     // be reached. Nothing is cached here: every call asks libdbus again.
     static DBusConnection* get(DBusBusType type);
 
-    // Drops one reference taken by get(). Must not be given null.
+    // Drops one reference taken by get(); null is ignored.
     static void unref(DBusConnection* connection);
 };
 

@@ -16,6 +16,9 @@ DBusConnection* Connection::get(DBusBusType type) {
     return connection;
 }
 
-void Connection::unref(DBusConnection* connection) { dbus_connection_unref(connection); }
+void Connection::unref(DBusConnection* connection) {
+    // libdbus would abort the process on null.
+    if (connection != 0) dbus_connection_unref(connection);
+}
 
 }  // namespace Bluetooth
