@@ -199,6 +199,10 @@ private:
     // on its arguments; the reply is handed to holder, which releases it.
     bool takeReply(DBusMessage*& holder, DBusMessageIter& iterator);
     int readStringArray(std::vector<std::string>& values);
+    // Appends the entries of a dictionary array to dict, up to an entry with an
+    // empty name; says which part of an entry could not be decoded.
+    enum { kEntriesDecoded, kBadEntryName, kBadEntryValue };
+    int decodeEntries(DBusMessageIter& array, Dict& dict);
 
     friend void* receiveSignal(void* object);
 };

@@ -575,19 +575,23 @@ int RemoteObject::getReplyValue(Dict& dict) {
         dbus_message_iter_get_element_type(&arguments) != DBUS_TYPE_DICT_ENTRY)
         return fail(5);
     dict.clear();
-    DBusMessageIter array;
-    dbus_message_iter_recurse(&arguments, &array);
-    for (; basicTypeOf(array) == DBUS_TYPE_DICT_ENTRY; dbus_message_iter_next(&array)) {
+    return decodeEntries(arguments, dict) == kEntriesDecoded ? 0 : -1;
+}
+
+int RemoteObject::decodeEntries(DBusMessageIter& array, Dict& dict) {
+    DBusMessageIter element;
+    dbus_message_iter_recurse(&array, &element);
+    for (; basicTypeOf(element) == DBUS_TYPE_DICT_ENTRY; dbus_message_iter_next(&element)) {
         DBusMessageIter field;
-        dbus_message_iter_recurse(&array, &field);
+        dbus_message_iter_recurse(&element, &field);
         Entry entry;
-        if (parseEntryName(field, entry) != 0) return -1;
-        if (entry.first.empty()) return 0;  // ends the dictionary, on purpose
+        if (parseEntryName(field, entry) != 0) return kBadEntryName;
+        if (entry.first.empty()) break;  // ends the dictionary quietly, on purpose
         dbus_message_iter_next(&field);
-        if (parseEntryValue(field, entry) != 0) return -1;
+        if (parseEntryValue(field, entry) != 0) return kBadEntryValue;
         dict.push_back(entry);
     }
-    return 0;
+    return kEntriesDecoded;
 }
 
 int RemoteObject::parseEntryName(DBusMessageIter& iterator, Entry& entry) {
@@ -829,23 +833,13 @@ void RemoteObject::signalHandlerDispatcherStringDict(RemoteObject* object, DBusM
                         return false;
                     }
                     Dict dict;
-                    DBusMessageIter array;
-                    dbus_message_iter_recurse(&arguments, &array);
-                    for (; basicTypeOf(array) == DBUS_TYPE_DICT_ENTRY; dbus_message_iter_next(&array)) {
-                        DBusMessageIter field;
-                        dbus_message_iter_recurse(&array, &field);
-                        Entry entry;
-                        if (object->parseEntryName(field, entry) != 0) {
-                            BT_LOG_ERR("Failed to parse entry name");
-                            return false;
-                        }
-                        if (entry.first.empty()) break;  // drops the rest, as replies do
-                        dbus_message_iter_next(&field);
-                        if (object->parseEntryValue(field, entry) != 0) {
-                            BT_LOG_ERR("Failed to parse entry value");
-                            return false;
-                        }
-                        dict.push_back(entry);
+                    switch (object->decodeEntries(arguments, dict)) {
+                    case kBadEntryName:
+                        BT_LOG_ERR("Failed to parse entry name");
+                        return false;
+                    case kBadEntryValue:
+                        BT_LOG_ERR("Failed to parse entry value");
+                        return false;
                     }
                     handler.function(handler.object, text.c_str(), &dict);
                     return true;

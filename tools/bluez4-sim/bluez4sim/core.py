@@ -166,15 +166,20 @@ class Simulator:
 
     def build(self):
         """Create the starting scene's objects, silently."""
-        from .interfaces import AdapterInterface
         for info in self.scene:
-            adapter = Adapter(self, info)
-            self.adapters[info.name] = adapter
-            self.export(adapter.path, ADAPTER, AdapterInterface(adapter))
-            for dev in adapter.devices.values():
-                if dev.info.created:
-                    dev.export_object(temporary=False)
+            self.install_adapter(info)
         self.default = next(iter(self.adapters), None)
+
+    def install_adapter(self, info):
+        """Export an adapter and the device objects it starts with."""
+        from .interfaces import AdapterInterface
+        adapter = Adapter(self, info)
+        self.adapters[info.name] = adapter
+        self.export(adapter.path, ADAPTER, AdapterInterface(adapter))
+        for dev in adapter.devices.values():
+            if dev.info.created:
+                dev.export_object(temporary=False)
+        return adapter
 
     def reset(self, scene=None):
         """Back to the starting scene without emitting anything."""
@@ -340,15 +345,9 @@ class Simulator:
         return [a.path for a in self.adapters.values()]
 
     def add_adapter(self, info):
-        from .interfaces import AdapterInterface
         if info.name in self.adapters:
             raise bluez_error('AlreadyExists')
-        adapter = Adapter(self, info)
-        self.adapters[info.name] = adapter
-        self.export(adapter.path, ADAPTER, AdapterInterface(adapter))
-        for dev in adapter.devices.values():
-            if dev.info.created:
-                dev.export_object(temporary=False)
+        adapter = self.install_adapter(info)
         self.emit('/', MANAGER, 'AdapterAdded', 'o', adapter.path)
         self.emit_property('/', MANAGER, 'Adapters', 'ao', self.adapter_paths())
         if self.default is None:
