@@ -3,6 +3,8 @@
 #include <atomic>
 #include <cerrno>
 #include <csignal>
+#include <chrono>
+#include <condition_variable>
 #include <cstdio>
 #include <iostream>
 #include <mutex>
@@ -66,6 +68,7 @@ struct LoopState {
     // waiting in sendMessagePending, say).
     std::atomic<RemoteObject*> owner;
     int wake[2];  // written when messages are queued or the loops must stop
+    std::atomic<int> running;  // receiving threads serving this connection
 };
 
 std::mutex gLoopsLock;
@@ -123,6 +126,7 @@ LoopState* prepareLoop(DBusConnection* connection, RemoteObject* owner) {
     if (state == 0) {
         state = new LoopState;
         state->connection = connection;
+        state->running = 0;
         if (pipe2(state->wake, O_NONBLOCK | O_CLOEXEC) != 0) {
             BT_LOG_ERR("Failed to create wake-up pipe (%d)", errno);
             state->wake[0] = state->wake[1] = -1;
@@ -178,6 +182,77 @@ bool waitReadable(DBusConnection* connection, LoopState* state, int milliseconds
     if (poll(fds, count, milliseconds) <= 0) return false;
     if (state != 0 && state->wake[0] >= 0 && fds[0].revents != 0) drain(state->wake[0]);
     return fd >= 0 && fds[count - 1].revents != 0;
+}
+
+// ---- blocking calls beside a receiving thread ----
+
+// libdbus's own default, used for a time-out of -1.
+const int kDefaultTimeoutMs = 25000;
+
+struct Waiter {
+    std::mutex lock;
+    std::condition_variable done;
+    bool completed;
+};
+
+void onCompleted(DBusPendingCall*, void* data) {
+    Waiter* waiter = static_cast<Waiter*>(data);
+    std::lock_guard<std::mutex> hold(waiter->lock);
+    waiter->completed = true;
+    waiter->done.notify_all();
+}
+
+void freeWaiter(void* data) { delete static_cast<Waiter*>(data); }
+
+// The loop that serves connection, unless this thread is that loop.
+LoopState* servingLoop(DBusConnection* connection) {
+    if (tDispatching != 0) return 0;
+    std::lock_guard<std::mutex> lock(gLoopsLock);
+    LoopState* state = findLoop(connection);
+    return state != 0 && state->running > 0 ? state : 0;
+}
+
+// A blocking call that leaves the connection's I/O to the receiving thread. A
+// thread blocked in libdbus holds the I/O path: the answers that handlers on
+// the receiving thread send (the agent's, say) would wait for it, and a call
+// whose reply depends on them would stall until its time-out.
+DBusMessage* callThroughLoop(LoopState* loop, DBusConnection* connection, DBusMessage* message,
+                             int timeout, DBusError* error) {
+    DBusPendingCall* pending = 0;
+    if (!dbus_connection_send_with_reply(connection, message, &pending, timeout) || pending == 0) {
+        dbus_set_error_const(error, DBUS_ERROR_DISCONNECTED, "Connection is closed");
+        return 0;
+    }
+    Waiter* waiter = new Waiter;
+    waiter->completed = false;
+    dbus_pending_call_set_notify(pending, &onCompleted, waiter, &freeWaiter);
+    dbus_connection_flush(connection);
+    std::chrono::steady_clock::time_point deadline =
+        std::chrono::steady_clock::now() +
+        std::chrono::milliseconds(timeout < 0 ? kDefaultTimeoutMs : timeout);
+    while (!dbus_pending_call_get_completed(pending)) {
+        if (loop->running == 0) {  // nobody dispatches any more
+            dbus_pending_call_block(pending);
+            break;
+        }
+        if (std::chrono::steady_clock::now() >= deadline) break;
+        std::unique_lock<std::mutex> hold(waiter->lock);
+        waiter->done.wait_for(hold, std::chrono::milliseconds(100), [waiter] { return waiter->completed; });
+    }
+    DBusMessage* reply = 0;
+    if (dbus_pending_call_get_completed(pending)) {
+        reply = dbus_pending_call_steal_reply(pending);
+    } else {
+        dbus_pending_call_cancel(pending);
+        dbus_set_error_const(error, DBUS_ERROR_NO_REPLY,
+                             "Did not receive a reply: the time-out expired before the peer answered");
+    }
+    dbus_pending_call_unref(pending);
+    if (reply != 0 && dbus_set_error_from_message(error, reply)) {
+        dbus_message_unref(reply);
+        reply = 0;
+    }
+    return reply;
 }
 
 // ---- pending calls ----
@@ -415,8 +490,12 @@ int RemoteObject::sendMessage(bool waitReply, int timeout) {
         result = waitReply ? fail(kBusError, why) : fail(10);
     } else if (waitReply) {
         // libdbus aborts on a time-out below -1; those mean its default as well.
-        reply = dbus_connection_send_with_reply_and_block(connection, message,
-                                                          timeout < -1 ? -1 : timeout, error.get());
+        if (timeout < -1) timeout = -1;
+        LoopState* loop = servingLoop(connection);
+        if (loop != 0)
+            reply = callThroughLoop(loop, connection, message, timeout, error.get());
+        else
+            reply = dbus_connection_send_with_reply_and_block(connection, message, timeout, error.get());
         if (reply == 0) result = fail(kBusError, error.text());
     } else {
         dbus_message_set_no_reply(message, TRUE);
@@ -858,8 +937,13 @@ void RemoteObject::signalHandlerDispatcherNoArgument(RemoteObject* object, DBusM
 // ---- receiving thread ----
 
 int RemoteObject::startLoop() {
-    if (connection != 0) prepareLoop(connection, this);
-    return pthread_create(&thread, 0, &receiveSignal, this);
+    // Counted before the thread runs, so that calls made right after this
+    // already leave the connection's I/O to it; the thread uncounts itself.
+    LoopState* state = connection != 0 ? prepareLoop(connection, this) : 0;
+    if (state != 0) ++state->running;
+    int result = pthread_create(&thread, 0, &receiveSignal, this);
+    if (result != 0 && state != 0) --state->running;
+    return result;
 }
 
 void RemoteObject::stopLoop() {
@@ -910,6 +994,7 @@ void* receiveSignal(void* data) {
             dbus_connection_read_write(connection, 0);
         }
     }
+    if (state != 0) --state->running;
     tDispatching = 0;
     return 0;
 }

@@ -61,6 +61,32 @@ TEST_F(TheReceivingThreadBesideCalls, AnswersCallsToARegisteredObjectPath) {
     EXPECT_NE(served.state.thread.load(), std::this_thread::get_id());
 }
 
+TEST_F(TheReceivingThreadBesideCalls, AnswersACallBackThatABlockingCallWaitsFor) {
+    ServedPath served(*peer);
+    // The peer calls this process back before it answers: the answer can only
+    // be written while the blocking call waits, by the receiving thread.
+    ASSERT_EQ(peer->newMessage("CallBack"), 0);
+    ASSERT_EQ(peer->append(peer->getConnectionName()), 0);
+    ASSERT_EQ(peer->append(ObjectPath(ServedPath::kPath)), 0);
+    ASSERT_EQ(peer->sendMessage(true, 5000), 0) << peer->getErrorMessage();
+    std::string answer;
+    EXPECT_EQ(peer->getReplyValue(answer), 0);
+    EXPECT_EQ(answer, "called back: pong: ping");
+    EXPECT_NE(served.state.thread.load(), std::this_thread::get_id());
+}
+
+TEST_F(TheReceivingThreadBesideCalls, TimesOutABlockingCallThatGetsNoReply) {
+    ASSERT_EQ(peer->newMessage("Sleep"), 0);
+    ASSERT_EQ(peer->append(1000u), 0);
+    EXPECT_EQ(peer->sendMessage(true, 200), -1);
+    EXPECT_EQ(peer->getErrorNumber(), 11);
+    EXPECT_NE(peer->getErrorMessage().find("reply"), std::string::npos) << peer->getErrorMessage();
+    callPeer(*peer, "Echo", "after");  // the late reply is dropped
+    std::string answer;
+    EXPECT_EQ(peer->getReplyValue(answer), 0);
+    EXPECT_EQ(answer, "after");
+}
+
 // Stopping is final for the whole process, so it runs in a child of its own.
 TEST(StoppingTheLoop, EndsEveryReceivingThreadAndThoseStartedLater) {
     GTEST_FLAG_SET(death_test_style, "threadsafe");

@@ -102,6 +102,7 @@ inline DBusHandlerResult answerPing(DBusConnection* connection, DBusMessage* mes
     DBusMessage* reply = dbus_message_new_method_return(message);
     dbus_message_append_args(reply, DBUS_TYPE_STRING, &text, DBUS_TYPE_INVALID);
     dbus_connection_send(connection, reply, nullptr);
+    dbus_connection_flush(connection);  // as the agent does
     dbus_message_unref(reply);
     return DBUS_HANDLER_RESULT_HANDLED;
 }
