@@ -188,6 +188,13 @@ bool waitReadable(DBusConnection* connection, LoopState* state, int milliseconds
 
 // libdbus's own default, used for a time-out of -1.
 const int kDefaultTimeoutMs = 25000;
+// How long queued messages may wait for a busy dispatcher before a waiting
+// call looks for its reply itself.
+const int kDispatchStallMs = 50;
+
+// Counts the dispatches this library has finished, on any thread: a waiting
+// call sees from it whether dispatching is making progress.
+std::atomic<unsigned long> gDispatches(0);
 
 struct Waiter {
     std::mutex lock;
@@ -230,14 +237,26 @@ DBusMessage* callThroughLoop(LoopState* loop, DBusConnection* connection, DBusMe
     std::chrono::steady_clock::time_point deadline =
         std::chrono::steady_clock::now() +
         std::chrono::milliseconds(timeout < 0 ? kDefaultTimeoutMs : timeout);
+    unsigned long seen = gDispatches;
+    std::chrono::steady_clock::time_point progress = std::chrono::steady_clock::now();
     while (!dbus_pending_call_get_completed(pending)) {
-        if (loop->running == 0) {  // nobody dispatches any more
+        std::chrono::steady_clock::time_point now = std::chrono::steady_clock::now();
+        if (gDispatches != seen) {
+            seen = gDispatches;
+            progress = now;
+        }
+        // Nobody dispatches any more, or a handler keeps the dispatcher busy
+        // (the agent's delay, say) while the reply may be queued behind it:
+        // libdbus's own wait finds a queued reply without dispatching.
+        bool stalled = now - progress > std::chrono::milliseconds(kDispatchStallMs) &&
+                       dbus_connection_get_dispatch_status(connection) == DBUS_DISPATCH_DATA_REMAINS;
+        if (loop->running == 0 || stalled) {
             dbus_pending_call_block(pending);
             break;
         }
-        if (std::chrono::steady_clock::now() >= deadline) break;
+        if (now >= deadline) break;
         std::unique_lock<std::mutex> hold(waiter->lock);
-        waiter->done.wait_for(hold, std::chrono::milliseconds(100), [waiter] { return waiter->completed; });
+        waiter->done.wait_for(hold, std::chrono::milliseconds(10), [waiter] { return waiter->completed; });
     }
     DBusMessage* reply = 0;
     if (dbus_pending_call_get_completed(pending)) {
@@ -552,7 +571,9 @@ int RemoteObject::sendMessagePending() {
         dbus_connection_flush(connection);
         installInterruptHandlers();
         while (!gFlags[kInterrupted] && !gFlags[kReplyArrived]) {
-            if (!dbus_connection_read_write_dispatch(connection, 500)) break;
+            bool open = dbus_connection_read_write_dispatch(connection, 500);
+            ++gDispatches;
+            if (!open) break;
         }
         if (pending != 0) {
             // Claim the reply so that a late notify cannot touch this object after
@@ -981,6 +1002,7 @@ void* receiveSignal(void* data) {
             // Dispatching, rather than popping, lets every reply reach the call
             // waiting for it and every method call reach its object path.
             dbus_connection_dispatch(connection);
+            ++gDispatches;
             continue;
         }
         if (waitReadable(connection, state, 100, true)) {
