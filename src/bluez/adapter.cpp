@@ -1,0 +1,263 @@
+#include <bluetooth/adapter.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <memory>
+#include <string>
+
+#include <fcntl.h>
+#include <spawn.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <bluetooth/util.h>
+
+#include "bluez/signal_line.h"
+#include "core/call.h"
+
+extern char** environ;
+
+BT_LOG_FILE("adapter.cpp");
+
+namespace Bluetooth {
+
+namespace {
+
+using internal::Op;
+using internal::kNoReply;
+
+const Op kRequestSession = { "RequestSession", false, 83 };
+const Op kReleaseSession = { "ReleaseSession", false, 105 };
+const Op kStartDiscovery = { "StartDiscovery", false, 127 };
+const Op kStopDiscovery = { "StopDiscovery", false, 149 };
+const char kFindDevice[] = "FindDevice";
+const int kFindDeviceLogLine = 180;
+const Op kListDevices = { "ListDevices", true, 212 };
+const Op kListDevicesByIndex = { "ListDevices", true, 243 };
+const Op kCreateDevice = { "CreateDevice", true, 274 };
+const char kCreatePairedDevice[] = "CreatePairedDevice";
+const int kCreatePairedDeviceLogLine = 312;
+const Op kCancelDeviceCreation = { "CancelDeviceCreation", false, 337 };
+const Op kRemoveDevice = { "RemoveDevice", false, 363 };
+const Op kRegisterAgent = { "RegisterAgent", false, 393 };
+const Op kUnregisterAgent = { "UnregisterAgent", false, 419 };
+const int kHciconfigLogLine = 438;
+
+enum { kFound, kDisappeared, kCreated, kRemoved };
+// deliberate: " was disappeared in " is the required wording.
+const internal::SignalLine kSignals[] = {
+    { "DeviceFound", "", " was found by ", "\n" },
+    { "DeviceDisappeared", "", " was disappeared in ", "" },
+    { "DeviceCreated", "", " was created by ", "" },
+    { "DeviceRemoved", "", " was removed by ", "" },
+};
+
+const char kHciconfig[] = "/usr/bin/hciconfig";
+const char kHciVersionKey[] = "HCIVersion";
+
+const char* textOf(const ObjectPath* path) { return path != 0 ? path->c_str() : 0; }
+
+// The last component of an object path: the controller's name ("hci0").
+std::string controllerName(const std::string& path) {
+    std::string::size_type slash = path.rfind('/');
+    return slash == std::string::npos ? path : path.substr(slash + 1);
+}
+
+// A program's standard output as a stream, started without a shell, and reaped
+// when the pipe is closed.
+class CommandPipe {
+public:
+    CommandPipe(const char* program, const char* const* argv) : stream_(0), pid_(-1) {
+        // posix_spawn reports a missing program only through the child's exit
+        // status, too late to tell "cannot start" from "printed nothing".
+        if (access(program, X_OK) != 0) return;
+        int fds[2];
+        if (pipe2(fds, O_CLOEXEC) != 0) return;
+        posix_spawn_file_actions_t actions;
+        posix_spawn_file_actions_init(&actions);
+        posix_spawn_file_actions_adddup2(&actions, fds[1], STDOUT_FILENO);
+        int failed = posix_spawn(&pid_, program, &actions, 0, const_cast<char* const*>(argv),
+                                 environ);
+        posix_spawn_file_actions_destroy(&actions);
+        close(fds[1]);
+        if (failed != 0) {
+            pid_ = -1;
+            close(fds[0]);
+            return;
+        }
+        stream_ = fdopen(fds[0], "r");
+        if (stream_ == 0) close(fds[0]);
+    }
+
+    ~CommandPipe() {
+        if (stream_ != 0) fclose(stream_);
+        if (pid_ > 0) {
+            int status = 0;
+            while (waitpid(pid_, &status, 0) < 0 && errno == EINTR) {
+            }
+        }
+    }
+
+    // Null when the program could not be started.
+    FILE* stream() const { return stream_; }
+
+private:
+    CommandPipe(const CommandPipe&) = delete;
+    CommandPipe& operator=(const CommandPipe&) = delete;
+
+    FILE* stream_;
+    pid_t pid_;
+};
+
+}  // namespace
+
+DeviceList::~DeviceList() {
+    for (iterator it = begin(); it != end(); ++it) delete *it;
+}
+
+Adapter::Adapter(const char* path) : BluezObject(path, "org.bluez.Adapter") {}
+
+Adapter::~Adapter() {}
+
+Adapter* Adapter::getAdapter(const char* path) { return hasBluetoothd() ? new Adapter(path) : 0; }
+
+int Adapter::requestSession() { return internal::call(*this, kLogFile, kRequestSession, kNoReply); }
+
+int Adapter::releaseSession() { return internal::call(*this, kLogFile, kReleaseSession, kNoReply); }
+
+int Adapter::startDiscovery() { return internal::call(*this, kLogFile, kStartDiscovery, kNoReply); }
+
+int Adapter::stopDiscovery() { return internal::call(*this, kLogFile, kStopDiscovery, kNoReply); }
+
+Device* Adapter::findDevice(const char* address, bool logError) {
+    const Op op = { kFindDevice, true, logError ? kFindDeviceLogLine : internal::kSilent };
+    ObjectPath path;
+    if (internal::call(*this, kLogFile, op, &path, address) != 0) return 0;
+    return Device::getDevice(path);
+}
+
+Device* Adapter::createDevice(const char* address) {
+    ObjectPath path;
+    if (internal::call(*this, kLogFile, kCreateDevice, &path, address) != 0) return 0;
+    return Device::getDevice(path);
+}
+
+Device* Adapter::createPairedDevice(const char* address, const Agent& agent) {
+    // By hand: the one call sent with sendMessagePending, which dispatches the
+    // connection on this thread so that the agent can answer meanwhile.
+    resetError();
+    ObjectPath path;
+    int result = newMessage(kCreatePairedDevice);
+    if (result == 0)
+        result = internal::appendAll(*this, address, ObjectPath(agent.getPath()),
+                                     agent.getCapability());
+    if (result == 0) result = sendMessagePending();
+    if (result == 0) result = getReplyValue(path);
+    if (hasError())
+        internal::logError(kLogFile, kCreatePairedDeviceLogLine, "%s", getErrorMessage().c_str());
+    return result == 0 ? Device::getDevice(path) : 0;
+}
+
+int Adapter::cancelDeviceCreation(const char* address) {
+    return internal::call(*this, kLogFile, kCancelDeviceCreation, kNoReply, address);
+}
+
+int Adapter::removeDevice(const char* devicePath) {
+    if (devicePath == 0) {
+        // ObjectPath cannot hold a null text; report it as any null argument.
+        resetError();
+        fail(1);
+        internal::logError(kLogFile, kRemoveDevice.logLine, "%s", getErrorMessage().c_str());
+        return -1;
+    }
+    return internal::call(*this, kLogFile, kRemoveDevice, kNoReply, ObjectPath(devicePath));
+}
+
+int Adapter::registerAgent(const Agent& agent) {
+    return internal::call(*this, kLogFile, kRegisterAgent, kNoReply, ObjectPath(agent.getPath()),
+                          agent.getCapability());
+}
+
+int Adapter::unregisterAgent(const Agent& agent) {
+    return internal::call(*this, kLogFile, kUnregisterAgent, kNoReply,
+                          ObjectPath(agent.getPath()));
+}
+
+Device* Adapter::getDeviceByIndex(unsigned int index) {
+    std::vector<ObjectPath> paths;
+    if (internal::call(*this, kLogFile, kListDevicesByIndex, &paths) != 0) return 0;
+    return index < paths.size() ? Device::getDevice(paths[index]) : 0;  // no fallback here
+}
+
+DeviceList* Adapter::listDevices() {
+    std::vector<ObjectPath> paths;
+    if (internal::call(*this, kLogFile, kListDevices, &paths) != 0) return 0;
+    DeviceList* devices = new DeviceList;
+    for (size_t i = 0; i < paths.size(); ++i) devices->push_back(Device::getDevice(paths[i]));
+    return devices;
+}
+
+Dict* Adapter::getProperties() {
+    Dict* properties = BluezObject::getProperties();
+    if (properties == 0) return 0;
+    std::string controller = controllerName(path);
+    const char* const argv[] = { kHciconfig, controller.c_str(), "-a", 0 };
+    CommandPipe command(kHciconfig, argv);
+    if (command.stream() == 0) {
+        internal::logError(kLogFile, kHciconfigLogLine, "Failed to get open(%s %s)", kHciconfig,
+                           controller.c_str());
+        return properties;
+    }
+    Entry version(kHciVersionKey, std::string());
+    char line[1024];
+    char token[1024];
+    while (fgets(line, sizeof line, command.stream()) != 0) {
+        if (sscanf(line, "\tHCI Version: %1023s", token) == 1) {
+            version.second = std::string(token);  // only the first word is kept
+            break;
+        }
+    }
+    properties->push_back(version);
+    return properties;
+}
+
+int Adapter::setDeviceFoundHandler(DeviceFoundHandler handler) {
+    return setSignalHandlerStringDict(kSignals[kFound].signal,
+                                      handler != 0 ? handler : &deviceFoundHandler);
+}
+
+int Adapter::setDeviceDisappearedHandler(DeviceDisappearedHandler handler) {
+    return setSignalHandlerString(kSignals[kDisappeared].signal,
+                                  handler != 0 ? handler : &deviceDisappearedHandler);
+}
+
+int Adapter::setDeviceCreatedHandler(DevicePathHandler handler) {
+    return setSignalHandlerObjectPath(kSignals[kCreated].signal,
+                                      handler != 0 ? handler : &deviceCreatedHandler);
+}
+
+int Adapter::setDeviceRemovedHandler(DevicePathHandler handler) {
+    return setSignalHandlerObjectPath(kSignals[kRemoved].signal,
+                                      handler != 0 ? handler : &deviceRemovedHandler);
+}
+
+void Adapter::deviceFoundHandler(RemoteObject* object, const char* address,
+                                 const Dict* properties) {
+    std::string text;
+    if (properties != 0) text = dictToString(*properties);
+    internal::printLine(kSignals[kFound], address, object, properties != 0 ? text.c_str() : 0);
+}
+
+void Adapter::deviceDisappearedHandler(RemoteObject* object, const char* address) {
+    internal::printLine(kSignals[kDisappeared], address, object);
+}
+
+void Adapter::deviceCreatedHandler(RemoteObject* object, const ObjectPath* path) {
+    internal::printLine(kSignals[kCreated], textOf(path), object);
+}
+
+void Adapter::deviceRemovedHandler(RemoteObject* object, const ObjectPath* path) {
+    internal::printLine(kSignals[kRemoved], textOf(path), object);
+}
+
+}  // namespace Bluetooth

@@ -1,0 +1,25 @@
+#include <bluetooth/dbus_object.h>
+
+#include "core/call.h"
+
+BT_LOG_FILE("dbus_object.cpp");
+
+namespace Bluetooth {
+
+namespace {
+const internal::Op kListNames = { "ListNames", true, 42 };
+}
+
+DBusObject::DBusObject()
+    : RemoteObject("org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
+                   DBUS_BUS_SYSTEM) {}
+
+DBusObject::~DBusObject() {}
+
+std::vector<std::string>* DBusObject::listNames() {
+    std::vector<std::string>* names = new std::vector<std::string>;
+    internal::call(*this, kLogFile, kListNames, names);
+    return names;
+}
+
+}  // namespace Bluetooth

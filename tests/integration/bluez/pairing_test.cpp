@@ -1,0 +1,313 @@
+// Adapter::createPairedDevice with the library's own Agent answering
+// bluez4-sim, and the agent answering outside any pairing call.
+#include <atomic>
+#include <chrono>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include <bluetooth/btbus.h>
+
+#include "core/dbus_holders.h"
+#include "support/log_capture.h"
+#include "support/process.h"
+#include "support/sim.h"
+
+namespace {
+
+using namespace Bluetooth;
+using btbus_test::LogCapture;
+using btbus_test::SimTest;
+using btbus_test::waitUntil;
+using namespace std::chrono_literals;
+namespace sim = btbus_test::sim;
+using btbus_test::sim::kKeyboard;
+using btbus_test::sim::kPhone;
+using btbus_test::sim::kFarLaptop;
+
+const char kA2dpSink[] = "0000110b-0000-1000-8000-00805f9b34fb";
+
+// What reached the agent, and on which thread: a dispatcher in front of the
+// agent's own.
+std::mutex gLock;
+std::vector<std::string> gMembers;
+std::vector<std::thread::id> gThreads;
+DBusHandlerResult recordingDispatcher(DBusConnection* connection, DBusMessage* message, void* agent) {
+    {
+        std::lock_guard<std::mutex> lock(gLock);
+        gMembers.push_back(dbus_message_get_member(message) ? dbus_message_get_member(message) : "");
+        gThreads.push_back(std::this_thread::get_id());
+    }
+    return Agent::handlerDispatcher(connection, message, agent);
+}
+std::vector<std::string> members() {
+    std::lock_guard<std::mutex> lock(gLock);
+    return gMembers;
+}
+bool reached(const std::string& member) {
+    std::vector<std::string> seen = members();
+    return std::find(seen.begin(), seen.end(), member) != seen.end();
+}
+
+class APairing : public SimTest {
+protected:
+    void SetUp() override {
+        SimTest::SetUp();
+        {
+            std::lock_guard<std::mutex> lock(gLock);
+            gMembers.clear();
+            gThreads.clear();
+        }
+        adapter.reset(Adapter::getAdapter(sim::defaultAdapterPath().c_str()));
+        ASSERT_NE(adapter, nullptr);
+        ASSERT_EQ(agent.setDispatcher(&recordingDispatcher), 0);
+        ASSERT_EQ(agent.registerPath(), 0);
+        prefix = std::string("agent ") + adapter->getConnectionName() + " " + agent.getPath() +
+                 " org.bluez.Agent.";
+    }
+    void TearDown() override { agent.unregisterPath(); }
+
+    // The simulator's record of its calls to this agent.
+    std::vector<std::string> agentCalls() { return sim::logLinesWith(prefix); }
+    std::string call(const std::string& rest) { return prefix + rest; }
+
+    std::unique_ptr<Adapter> adapter;
+    Agent agent;
+    std::string prefix;
+};
+
+TEST_F(APairing, AnswersAPinRequestWithThePasskeyTextAndIsReleasedAfterwards) {
+    ASSERT_EQ(agent.setPasskeyValue("0000"), 0);
+    LogCapture log;
+    std::unique_ptr<Device> keyboard(adapter->createPairedDevice(kKeyboard, agent));
+    ASSERT_NE(keyboard, nullptr) << adapter->getErrorMessage();
+    const std::string device = sim::devicePath(kKeyboard);
+    EXPECT_EQ(keyboard->getPath(), device);
+    EXPECT_EQ(sim::logLinesWith("CreatePairedDevice"),
+              std::vector<std::string>{ sim::defaultAdapterPath() + " org.bluez.Adapter.CreatePairedDevice(" +
+                                        kKeyboard + ", " + agent.getPath() + ", DisplayYesNo)" });
+    EXPECT_EQ(agentCalls(), (std::vector<std::string>{ call("RequestPinCode(" + device + ") -> 0000"),
+                                                       call("Release() -> sent") }));
+    EXPECT_TRUE(waitUntil([] { return reached("Release"); }));
+    EXPECT_TRUE(log.lines().empty());
+    std::unique_ptr<Dict> properties(keyboard->getProperties());
+    ASSERT_TRUE(properties != nullptr);
+    EXPECT_EQ(Bluetooth::find(properties.get(), "Paired"), "1");
+}
+
+TEST_F(APairing, StillAnswersAPinRequestWhenRejecting) {
+    ASSERT_EQ(agent.setPasskeyValue("0000"), 0);
+    agent.setReject(true);
+    std::unique_ptr<Device> keyboard(adapter->createPairedDevice(kKeyboard, agent));
+    EXPECT_NE(keyboard, nullptr) << adapter->getErrorMessage();
+    EXPECT_EQ(agentCalls().at(0), call("RequestPinCode(" + sim::devicePath(kKeyboard) + ") -> 0000"));
+}
+
+TEST_F(APairing, FailsAndLogsWhenThePinIsWrong) {
+    LogCapture log;  // the default passkey "7391" is not the keyboard's PIN
+    EXPECT_EQ(adapter->createPairedDevice(kKeyboard, agent), nullptr);
+    EXPECT_EQ(adapter->getErrorNumber(), 11);
+    EXPECT_EQ(agentCalls().at(0), call("RequestPinCode(" + sim::devicePath(kKeyboard) + ") -> 7391"));
+    ASSERT_EQ(log.lines().size(), 1u);
+    EXPECT_EQ(log.lines()[0], "adapter.cpp:312 " + adapter->getErrorMessage());
+    EXPECT_NE(adapter->getErrorMessage().find("Authentication"), std::string::npos);
+}
+
+TEST_F(APairing, AnswersAPasskeyRequestWithThePasskeyAsANumber) {
+    ASSERT_EQ(agent.setCapability(Agent::PSZ_KEYBOARD_ONLY), 0);
+    ASSERT_EQ(agent.setPasskeyValue("482913"), 0);
+    std::unique_ptr<Device> phone(adapter->createPairedDevice(kPhone, agent));
+    EXPECT_NE(phone, nullptr) << adapter->getErrorMessage();
+    EXPECT_EQ(agentCalls().at(0), call("RequestPasskey(" + sim::devicePath(kPhone) + ") -> 482913"));
+    EXPECT_EQ(sim::logLinesWith("CreatePairedDevice").at(0).find("KeyboardOnly)") != std::string::npos, true);
+}
+
+TEST_F(APairing, AnswersZeroForAPasskeyTextThatIsNotANumber) {
+    ASSERT_EQ(agent.setCapability(Agent::PSZ_KEYBOARD_ONLY), 0);
+    ASSERT_EQ(agent.setPasskeyValue("four"), 0);
+    EXPECT_EQ(adapter->createPairedDevice(kPhone, agent), nullptr);
+    EXPECT_EQ(agentCalls().at(0), call("RequestPasskey(" + sim::devicePath(kPhone) + ") -> 0"));
+}
+
+TEST_F(APairing, ConfirmsAPasskeyWithAnEmptyAnswerWithoutComparingIt) {
+    ASSERT_EQ(agent.setPasskeyValue("1"), 0);
+    std::unique_ptr<Device> phone(adapter->createPairedDevice(kPhone, agent));
+    EXPECT_NE(phone, nullptr) << adapter->getErrorMessage();
+    EXPECT_EQ(agentCalls().at(0), call("RequestConfirmation(" + sim::devicePath(kPhone) + ", 482913) -> "));
+}
+
+TEST_F(APairing, RefusesPasskeysAndConfirmationsWhenRejecting) {
+    agent.setReject(true);
+    LogCapture log;
+    EXPECT_EQ(adapter->createPairedDevice(kPhone, agent), nullptr);
+    ASSERT_EQ(agent.setCapability(Agent::PSZ_KEYBOARD_ONLY), 0);
+    EXPECT_EQ(adapter->createPairedDevice(kPhone, agent), nullptr);
+    const std::string device = sim::devicePath(kPhone);
+    EXPECT_EQ(sim::logLinesWith("org.bluez.Agent.Request"),
+              (std::vector<std::string>{
+                  call("RequestConfirmation(" + device + ", 482913) -> error org.bluez.Error.Rejected"),
+                  call("RequestPasskey(" + device + ") -> error org.bluez.Error.Rejected") }));
+    EXPECT_EQ(log.countEndingWith("Authentication Failed"), 2u);
+}
+
+TEST_F(APairing, WaitsForTheDelayBeforeAnswering) {
+    ASSERT_EQ(agent.setPasskeyValue("0000"), 0);
+    ASSERT_EQ(agent.setPasskeyDelay(1), 0);
+    auto start = std::chrono::steady_clock::now();
+    std::unique_ptr<Device> keyboard(adapter->createPairedDevice(kKeyboard, agent));
+    auto took = std::chrono::steady_clock::now() - start;
+    EXPECT_NE(keyboard, nullptr) << adapter->getErrorMessage();
+    EXPECT_GE(took, 1s);
+    EXPECT_LT(took, 5s);
+}
+
+TEST_F(APairing, ForwardsACancellationToTheAgentAndFails) {
+    sim::receivingLoop();  // to dispatch what arrives after the call returned
+    ASSERT_EQ(agent.setPasskeyValue("0000"), 0);
+    ASSERT_EQ(agent.setPasskeyDelay(1), 0);
+    std::thread canceller([this] {
+        // While the agent sits on the PIN request.
+        EXPECT_TRUE(waitUntil([] { return reached("RequestPinCode"); }));
+        std::unique_ptr<Adapter> other(Adapter::getAdapter(adapter->getPath()));
+        EXPECT_EQ(other->cancelDeviceCreation(kKeyboard), 0);
+    });
+    LogCapture log;
+    EXPECT_EQ(adapter->createPairedDevice(kKeyboard, agent), nullptr);
+    canceller.join();
+    EXPECT_EQ(log.lines(), std::vector<std::string>{ "adapter.cpp:312 Authentication Canceled" });
+    EXPECT_TRUE(waitUntil([] { return reached("Cancel") && reached("Release"); }));
+    std::vector<std::string> calls = agentCalls();
+    EXPECT_NE(std::find(calls.begin(), calls.end(), call("Cancel() -> sent")), calls.end());
+}
+
+TEST_F(APairing, ReleasesTheAgentWhenTheDeviceCannotBeReached) {
+    sim::receivingLoop();  // Release may follow the reply
+    LogCapture log;
+    EXPECT_EQ(adapter->createPairedDevice(kFarLaptop, agent), nullptr);
+    EXPECT_EQ(log.lines(), std::vector<std::string>{ "adapter.cpp:312 Page Timeout" });
+    EXPECT_EQ(agentCalls(), std::vector<std::string>{ call("Release() -> sent") });
+    EXPECT_TRUE(waitUntil([] { return reached("Release"); }));
+}
+
+TEST_F(APairing, IsAnsweredOnTheCallersThreadWhenNoReceivingThreadRuns) {
+    if (btbus_test::childRole() != "caller-thread") {
+        // Another receiving thread may already run here: run it in a fresh process.
+        EXPECT_EQ(btbus_test::runInChild("APairing.IsAnsweredOnTheCallersThreadWhenNoReceivingThreadRuns",
+                                         "caller-thread"), 0);
+        return;
+    }
+    ASSERT_FALSE(sim::receivingLoopRunning());
+    ASSERT_EQ(agent.setPasskeyValue("0000"), 0);
+    std::unique_ptr<Device> keyboard(adapter->createPairedDevice(kKeyboard, agent));
+    EXPECT_NE(keyboard, nullptr) << adapter->getErrorMessage();
+    std::lock_guard<std::mutex> lock(gLock);
+    ASSERT_FALSE(gThreads.empty());
+    EXPECT_EQ(gMembers[0], "RequestPinCode");
+    EXPECT_EQ(gThreads[0], std::this_thread::get_id());
+}
+
+TEST_F(APairing, AgentAuthorisesIncomingConnectionsOnTheReceivingThread) {
+    sim::receivingLoop();
+    ASSERT_EQ(adapter->registerAgent(agent), 0);
+    ASSERT_TRUE(sim::waitForLogLine("RegisterAgent"));
+    // Nothing dispatches the connection on this thread: only the receiving thread can answer.
+    EXPECT_EQ(sim::incomingConnection("hci0", kPhone, kA2dpSink), "accepted");
+    agent.setReject(true);
+    EXPECT_EQ(sim::incomingConnection("hci0", kPhone, kA2dpSink), "org.bluez.Error.Rejected");
+    const std::string device = sim::devicePath(kPhone);
+    EXPECT_EQ(agentCalls(), (std::vector<std::string>{
+                                call("Authorize(" + device + ", " + kA2dpSink + ") -> "),
+                                call("Authorize(" + device + ", " + kA2dpSink + ") -> error org.bluez.Error.Rejected") }));
+    std::lock_guard<std::mutex> lock(gLock);
+    ASSERT_EQ(gThreads.size(), 2u);
+    EXPECT_NE(gThreads[0], std::this_thread::get_id());
+    EXPECT_NE(gThreads[1], std::this_thread::get_id());
+}
+
+TEST_F(APairing, AgentAnswersAnIncomingPinRequestAndIsReleasedWhenUnregistered) {
+    sim::receivingLoop();
+    ASSERT_EQ(agent.setPasskeyValue("0000"), 0);
+    ASSERT_EQ(adapter->registerAgent(agent), 0);
+    ASSERT_TRUE(sim::waitForLogLine("RegisterAgent"));
+    EXPECT_EQ(sim::startIncomingPairing("hci0", kKeyboard), "accepted");
+    ASSERT_EQ(adapter->unregisterAgent(agent), 0);
+    EXPECT_TRUE(waitUntil([] { return reached("Release"); }));
+    EXPECT_EQ(agentCalls(), (std::vector<std::string>{
+                                call("RequestPinCode(" + sim::devicePath(kKeyboard) + ") -> 0000"),
+                                call("Release() -> sent") }));
+}
+
+// A raw connection of the test's own, calling the agent the way a peer would.
+class RawCaller {
+public:
+    RawCaller() {
+        connection_ = dbus_bus_get_private(DBUS_BUS_SYSTEM, nullptr);
+        if (connection_ != nullptr) dbus_connection_set_exit_on_disconnect(connection_, FALSE);
+    }
+    ~RawCaller() {
+        if (connection_ == nullptr) return;
+        dbus_connection_close(connection_);
+        dbus_connection_unref(connection_);
+    }
+    // The error name of the answer ("" for a method return).
+    std::string call(const std::string& destination, const char* path, const char* member,
+                     int timeoutMs, bool withDeviceAndPasskey) {
+        Bluetooth::internal::MessagePtr message(
+            dbus_message_new_method_call(destination.c_str(), path, "org.bluez.Agent", member));
+        if (withDeviceAndPasskey) {
+            const char* device = "/org/bluez/1/hci0/dev_00_11_22_33_44_55";
+            dbus_uint32_t passkey = 123456;
+            dbus_message_append_args(message.get(), DBUS_TYPE_OBJECT_PATH, &device, DBUS_TYPE_UINT32,
+                                     &passkey, DBUS_TYPE_INVALID);
+        }
+        Bluetooth::internal::ScopedError error;
+        Bluetooth::internal::MessagePtr reply(dbus_connection_send_with_reply_and_block(
+            connection_, message.get(), timeoutMs, error.get()));
+        return error.name();
+    }
+    bool ok() const { return connection_ != nullptr; }
+
+private:
+    DBusConnection* connection_ = nullptr;
+};
+
+TEST_F(APairing, AgentLogsAndLeavesUnansweredWhatItCannotHandle) {
+    sim::receivingLoop();
+    RawCaller peer;
+    ASSERT_TRUE(peer.ok());
+    const std::string me = adapter->getConnectionName();
+    LogCapture log;
+    // Not the agent's answer: libdbus answers what no handler took.
+    EXPECT_EQ(peer.call(me, agent.getPath(), "DisplayPasskey", 3000, true),
+              "org.freedesktop.DBus.Error.UnknownMethod");
+    EXPECT_EQ(peer.call(me, agent.getPath(), "RequestPasskey", 3000, false),
+              "org.freedesktop.DBus.Error.UnknownMethod");
+    // Bad arguments of a PIN request count as handled: no answer at all.
+    EXPECT_EQ(peer.call(me, agent.getPath(), "RequestPinCode", 300, false),
+              "org.freedesktop.DBus.Error.NoReply");
+    EXPECT_EQ(log.lines(), (std::vector<std::string>{
+                               "agent.cpp:410 Registered agent does not provide a handler for the incoming message.",
+                               "agent.cpp:200 Failed to get argument from request passkey message.",
+                               "agent.cpp:167 Failed to get argument from request pin code message." }));
+}
+
+TEST_F(APairing, AgentPathIsRegisteredOncePerProcess) {
+    LogCapture log;
+    Agent second;
+    EXPECT_EQ(second.registerPath(), -1);
+    EXPECT_STREQ(second.getPath(), agent.getPath());
+    EXPECT_EQ(second.unregisterPath(), -1) << "unregistered the other agent's path";
+    EXPECT_EQ(agent.unregisterPath(), 0);
+    EXPECT_EQ(agent.unregisterPath(), -1);
+    EXPECT_EQ(second.registerPath(), 0);
+    EXPECT_EQ(second.unregisterPath(), 0);
+    EXPECT_EQ(log.lines(), (std::vector<std::string>{ "agent.cpp:54 Failed to register agent path to dbus.",
+                                                      "agent.cpp:65 Failed to unregister agent path from dbus.",
+                                                      "agent.cpp:65 Failed to unregister agent path from dbus." }));
+}
+
+}  // namespace

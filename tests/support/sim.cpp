@@ -1,0 +1,235 @@
+#include "support/sim.h"
+
+#include <cstdlib>
+#include <cstring>
+#include <memory>
+
+#include <spawn.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <bluetooth/dbus_object.h>
+#include <bluetooth/remote_object.h>
+
+#include "core/call.h"
+#include "core/dbus_holders.h"
+#include "support/process.h"
+
+extern char** environ;
+
+namespace btbus_test {
+
+namespace {
+
+using Bluetooth::ObjectPath;
+using Bluetooth::RemoteObject;
+
+const char kControlPath[] = "/org/btbus/Simulator";
+const char kControlInterface[] = "org.btbus.Simulator";
+
+pid_t gSim = -1;
+RemoteObject* gLoop = nullptr;
+
+// Torn down before the private buses, which were registered earlier.
+class SimEnvironment : public ::testing::Environment {
+public:
+    void TearDown() override {
+        sim::kill();
+        if (gLoop != nullptr) {
+            gLoop->stopLoop();
+            gLoop->waitLoop();
+            delete gLoop;
+            gLoop = nullptr;
+        }
+    }
+};
+
+void stopAtExit() {
+    if (gSim > 0) stop(gSim, SIGKILL);
+    gSim = -1;
+}
+
+// One control call; the reply is read by read (null: none awaited).
+template <typename Read, typename... A>
+bool control(const char* method, Read read, const A&... args) {
+    RemoteObject object("org.bluez", kControlPath, kControlInterface, DBUS_BUS_SYSTEM);
+    int result = object.newMessage(method);
+    if (result == 0) result = Bluetooth::internal::appendAll(object, args...);
+    if (result == 0) result = object.sendMessage(true, -1);
+    if (result == 0) result = read(object);
+    if (result != 0) {
+        ADD_FAILURE() << "bluez4-sim " << method << " failed: " << object.getErrorMessage();
+        return false;
+    }
+    return true;
+}
+
+int noReply(RemoteObject&) { return 0; }
+
+std::string textReply(bool ok, const std::string& text) { return ok ? text : std::string(); }
+
+}  // namespace
+
+namespace sim {
+
+bool running() { return gSim > 0 && nameHasOwner(DBUS_BUS_SYSTEM, "org.bluez"); }
+
+bool start() {
+    if (gSim <= 0) {
+        requireDbusmock();
+        if (::testing::Test::HasFatalFailure()) return false;
+        static bool registered = false;
+        if (!registered) {
+            registered = true;
+            ::testing::AddGlobalTestEnvironment(new SimEnvironment);
+            std::atexit(&stopAtExit);
+        }
+        // Short rounds and links, so that discovery and idle links show quickly.
+        gSim = spawn({ kDebianPython, "-m", "dbusmock", "--system", "--template",
+                       std::string(BTBUS_SOURCE_DIR) + "/tools/bluez4-sim/bluez4.py", "-p",
+                       "{\"round_seconds\": 0.3, \"idle_seconds\": 0.5}" });
+        if (gSim <= 0) return false;
+        if (!waitForName(DBUS_BUS_SYSTEM, "org.bluez")) {
+            ADD_FAILURE() << "bluez4-sim did not take org.bluez";
+            kill();
+            return false;
+        }
+    }
+    reset();
+    return !::testing::Test::HasFailure();
+}
+
+void kill() {
+    if (gSim <= 0) return;
+    stop(gSim, SIGKILL);
+    gSim = -1;
+    waitUntil([] { return !nameHasOwner(DBUS_BUS_SYSTEM, "org.bluez"); });
+}
+
+void reset() { control("Reset", &noReply); }
+
+std::string addAdapter(const std::string& name, const std::string& address) {
+    ObjectPath path;
+    bool ok = control("AddAdapter", [&](RemoteObject& o) { return o.getReplyValue(path); },
+                      name.c_str(), address.c_str());
+    return textReply(ok, path.str());
+}
+
+void removeAdapter(const std::string& name) { control("RemoveAdapter", &noReply, name.c_str()); }
+
+void addDevice(const std::string& adapter, const std::string& json) {
+    control("AddDevice", &noReply, adapter.c_str(), json.c_str());
+}
+
+void setInRange(const std::string& adapter, const std::string& address, bool inRange) {
+    control("SetInRange", &noReply, adapter.c_str(), address.c_str(), inRange);
+}
+
+void setPlaying(const std::string& adapter, const std::string& address, bool playing) {
+    control("SetPlaying", &noReply, adapter.c_str(), address.c_str(), playing);
+}
+
+// The remote device's side. The simulator answers once this process's agent
+// has answered, which the receiving thread does while this call waits.
+std::string startIncomingPairing(const std::string& adapter, const std::string& address) {
+    std::string answer;
+    bool ok = control("StartIncomingPairing", [&](RemoteObject& o) { return o.getReplyValue(answer); },
+                      adapter.c_str(), address.c_str());
+    return textReply(ok, answer);
+}
+
+std::string incomingConnection(const std::string& adapter, const std::string& address,
+                               const std::string& uuid) {
+    std::string answer;
+    bool ok = control("IncomingConnection", [&](RemoteObject& o) { return o.getReplyValue(answer); },
+                      adapter.c_str(), address.c_str(), uuid.c_str());
+    return textReply(ok, answer);
+}
+
+void emitSignal(const std::string& path, const std::string& interface, const std::string& member,
+                const std::string& signature, const std::string& jsonArgs) {
+    control("EmitSignal", &noReply, ObjectPath(path), interface.c_str(), member.c_str(),
+            signature.c_str(), jsonArgs.c_str());
+}
+
+std::vector<std::string> callLog() {
+    std::vector<std::string> lines;
+    control("GetCallLog", [&](RemoteObject& o) { return o.getReplyValue(lines); });
+    return lines;
+}
+
+void clearCallLog() { control("ClearCallLog", &noReply); }
+
+std::string defaultAdapterPath() {
+    RemoteObject manager("org.bluez", "/", "org.bluez.Manager", DBUS_BUS_SYSTEM);
+    ObjectPath path;
+    if (manager.newMessage("DefaultAdapter") != 0 || manager.sendMessage(true, -1) != 0 ||
+        manager.getReplyValue(path) != 0)
+        return "";
+    return path.str();
+}
+
+std::string devicePath(const std::string& address) {
+    std::string path = defaultAdapterPath() + "/dev_" + address;
+    for (char& c : path)
+        if (c == ':') c = '_';
+    return path;
+}
+
+std::vector<std::string> logLinesWith(const std::string& text) {
+    std::vector<std::string> found;
+    for (const std::string& line : callLog())
+        if (line.find(text) != std::string::npos) found.push_back(line);
+    return found;
+}
+
+bool waitForLogLine(const std::string& text) {
+    return waitUntil([&] { return !logLinesWith(text).empty(); });
+}
+
+RemoteObject* receivingLoop() {
+    if (gLoop == nullptr) {
+        gLoop = new Bluetooth::DBusObject;
+        EXPECT_EQ(gLoop->startLoop(), 0);
+    }
+    return gLoop;
+}
+
+bool receivingLoopRunning() { return gLoop != nullptr; }
+
+}  // namespace sim
+
+int runInChild(const std::string& filter, const std::string& role,
+               const std::vector<std::string>& wrapper) {
+    char self[4096];
+    ssize_t length = readlink("/proc/self/exe", self, sizeof self - 1);
+    if (length <= 0) return -1;
+    self[length] = '\0';
+    std::vector<std::string> argv = wrapper;
+    argv.push_back(self);
+    argv.push_back("--gtest_filter=" + filter);
+    argv.push_back("--gtest_color=no");
+    std::vector<char*> args;
+    for (std::string& arg : argv) args.push_back(&arg[0]);
+    args.push_back(nullptr);
+    std::string roleVariable = "BTBUS_CHILD=" + role;
+    std::vector<char*> env;
+    for (char** e = environ; *e != nullptr; ++e)
+        if (std::strncmp(*e, "BTBUS_CHILD=", 12) != 0) env.push_back(*e);
+    env.push_back(&roleVariable[0]);
+    env.push_back(nullptr);
+    pid_t pid = -1;
+    if (posix_spawnp(&pid, args[0], nullptr, nullptr, args.data(), env.data()) != 0) return -1;
+    int status = 0;
+    if (waitpid(pid, &status, 0) != pid) return -1;
+    return status;
+}
+
+std::string childRole() {
+    const char* role = std::getenv("BTBUS_CHILD");
+    return role != nullptr ? role : "";
+}
+
+}  // namespace btbus_test

@@ -1,0 +1,90 @@
+#ifndef BTBUS_TESTS_SUPPORT_SIM_H
+#define BTBUS_TESTS_SUPPORT_SIM_H
+
+#include <string>
+#include <vector>
+
+#include <sys/types.h>
+
+#include <gtest/gtest.h>
+
+namespace Bluetooth {
+class RemoteObject;
+}
+
+namespace btbus_test {
+
+// bluez4-sim as "org.bluez" on the private system bus of this test binary,
+// started by the first test that needs it and stopped before the buses go.
+// Failures of the control calls fail the current test.
+namespace sim {
+
+// Starts the simulator unless it runs, and resets its scene and call log.
+// Call in every SetUp; returns false (with a failure added) when it cannot.
+bool start();
+// Kills the simulator (SIGKILL: no goodbye on the bus) and waits until
+// "org.bluez" has no owner.
+void kill();
+bool running();
+
+// The devices of the default scene (tools/bluez4-sim/default-scene.json).
+constexpr const char kHeadset[] = "00:0D:3C:A1:B2:C3";    // audio sink and remote control
+constexpr const char kKeyboard[] = "00:12:A1:B0:00:42";   // legacy: PIN "0000"
+constexpr const char kPhone[] = "5C:F3:70:61:A0:17";      // passkey 482913
+constexpr const char kFarLaptop[] = "00:24:7E:11:22:33";  // out of range
+constexpr const char kMouse[] = "00:1F:20:AB:CD:EF";      // paired: its device object exists
+
+// The simulator's control interface.
+void reset();
+std::string addAdapter(const std::string& name, const std::string& address);
+void removeAdapter(const std::string& name);
+void addDevice(const std::string& adapter, const std::string& json);
+void setInRange(const std::string& adapter, const std::string& address, bool inRange);
+void setPlaying(const std::string& adapter, const std::string& address, bool playing);
+// Requests a remote device starts; they wait for this process's agent, which
+// the receiving thread serves (answers: "accepted", "trusted", an error name).
+std::string startIncomingPairing(const std::string& adapter, const std::string& address);
+std::string incomingConnection(const std::string& adapter, const std::string& address,
+                               const std::string& uuid);
+void emitSignal(const std::string& path, const std::string& interface, const std::string& member,
+                const std::string& signature, const std::string& jsonArgs);
+std::vector<std::string> callLog();
+void clearCallLog();
+
+// The default adapter's path, asked of the simulator ("" on failure).
+std::string defaultAdapterPath();
+// The object path of a device address on the default adapter.
+std::string devicePath(const std::string& address);
+
+// Call-log lines that contain text, in order.
+std::vector<std::string> logLinesWith(const std::string& text);
+// Waits until a call-log line contains text.
+bool waitForLogLine(const std::string& text);
+
+// The one receiving thread of this binary, started on first use on a proxy
+// that lives until the end (stopLoop ends every loop for good, so it is stopped
+// only then). Returns that proxy: the object that argument-less signal handlers
+// receive.
+Bluetooth::RemoteObject* receivingLoop();
+bool receivingLoopRunning();
+
+}  // namespace sim
+
+// Tests against the simulator: started (once) and reset before each test.
+class SimTest : public ::testing::Test {
+protected:
+    void SetUp() override { ASSERT_TRUE(sim::start()); }
+};
+
+// Runs this test binary again with only the test named filter, with
+// BTBUS_CHILD=role in its environment, optionally behind a wrapper command
+// (e.g. {"unshare", "-m"}); returns the child's exit status (0: all passed).
+// The child starts its own private buses.
+int runInChild(const std::string& filter, const std::string& role,
+               const std::vector<std::string>& wrapper = {});
+// The role this process was started with by runInChild, "" in the parent.
+std::string childRole();
+
+}  // namespace btbus_test
+
+#endif

@@ -1,0 +1,189 @@
+// The agent's settings, its log lines and the dispatch of messages built in
+// memory (no bus: handlers are given a null connection, so no reply leaves).
+#include <string>
+#include <vector>
+
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <bluetooth/agent.h>
+
+#include "core/dbus_holders.h"
+#include "support/log_capture.h"
+
+namespace {
+
+using Bluetooth::Agent;
+using Bluetooth::internal::MessagePtr;
+using btbus_test::LogCapture;
+
+TEST(AnAgent, StartsWithItsDefaultAnswersAndNoPath) {
+    Agent agent;
+    EXPECT_STREQ(agent.getPasskeyValue(), "7391");
+    EXPECT_EQ(agent.getPasskeyDelay(), 0);
+    EXPECT_FALSE(agent.getReject());
+    EXPECT_STREQ(agent.getCapability(), "DisplayYesNo");
+    EXPECT_STREQ(agent.getPath(), "");
+    EXPECT_STREQ(agent.getInterface(), "org.bluez.Agent");
+    EXPECT_STREQ(Agent::PSZ_NO_INPUT_NO_OUTPUT, "NoInputNoOutput");
+    EXPECT_STREQ(Agent::PSZ_KEYBOARD_ONLY, "KeyboardOnly");
+    EXPECT_STREQ(Agent::PSZ_DISPLAY_ONLY, "DisplayOnly");
+}
+
+TEST(AnAgent, RefusesANullPasskeyAndANegativeDelayLoggingAndKeepingTheOldValue) {
+    LogCapture log;
+    Agent agent;
+    EXPECT_EQ(agent.setPasskeyValue("123456"), 0);
+    EXPECT_EQ(agent.setPasskeyValue(nullptr), -1);
+    EXPECT_STREQ(agent.getPasskeyValue(), "123456");
+    EXPECT_EQ(agent.setPasskeyDelay(2), 0);
+    EXPECT_EQ(agent.setPasskeyDelay(-1), -1);
+    EXPECT_EQ(agent.getPasskeyDelay(), 2);
+    EXPECT_EQ(agent.setPasskeyDelay(0), 0);
+    EXPECT_EQ(agent.getPasskeyDelay(), 0);
+    EXPECT_EQ(log.lines(), (std::vector<std::string>{
+                               "agent.cpp:87 Failed to set null passkey value.",
+                               "agent.cpp:106 Failed to set negitive passkey delay." }));
+}
+
+TEST(AnAgent, KeepsTheCapabilityPointerAndRefusesNullSilently) {
+    LogCapture log;
+    Agent agent;
+    char capability[] = "KeyboardOnly";
+    EXPECT_EQ(agent.setCapability(capability), 0);
+    EXPECT_EQ(agent.getCapability(), capability);  // not a copy
+    EXPECT_EQ(agent.setCapability(nullptr), -1);
+    EXPECT_EQ(agent.getCapability(), capability);
+    EXPECT_EQ(agent.setDispatcher(nullptr), -1);
+    agent.setReject(true);
+    EXPECT_TRUE(agent.getReject());
+    EXPECT_TRUE(log.lines().empty());
+}
+
+TEST(AnAgent, BuildsItsPathFromThePidEvenWhenItCannotRegisterIt) {
+    LogCapture log;
+    Agent agent;
+    EXPECT_EQ(agent.registerPath(), -1);
+    EXPECT_EQ(std::string(agent.getPath()), "/org/bluez/agent_" + std::to_string(getpid()));
+    EXPECT_EQ(agent.unregisterPath(), -1);
+    EXPECT_EQ(log.count("agent.cpp:54 Failed to register agent path to dbus."), 1u);
+    EXPECT_EQ(log.count("agent.cpp:65 Failed to unregister agent path from dbus."), 1u);
+}
+
+// As it would arrive: with a serial.
+MessagePtr call(const char* interface, const char* member) {
+    MessagePtr message(dbus_message_new_method_call(":1.1", "/org/bluez/agent_1", interface, member));
+    dbus_message_set_serial(message.get(), 7);
+    return message;
+}
+
+TEST(AnAgentsDispatcher, LogsTheRequestsWhoseArgumentsCannotBeReadAtTheirOwnLines) {
+    struct Case {
+        const char* member;
+        DBusHandlerResult result;
+        const char* line;
+    };
+    // deliberate asymmetry: only a PIN request counts bad arguments as handled.
+    const std::vector<Case> cases = {
+        { "RequestPinCode", DBUS_HANDLER_RESULT_HANDLED,
+          "agent.cpp:167 Failed to get argument from request pin code message." },
+        { "RequestPasskey", DBUS_HANDLER_RESULT_NOT_YET_HANDLED,
+          "agent.cpp:200 Failed to get argument from request passkey message." },
+        { "RequestConfirmation", DBUS_HANDLER_RESULT_NOT_YET_HANDLED,
+          "agent.cpp:252 Failed to get argument from request confirmation message." },
+        { "Authorize", DBUS_HANDLER_RESULT_NOT_YET_HANDLED,
+          "agent.cpp:293 Failed to get argument from authorize message." },
+    };
+    Agent agent;
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.member);
+        LogCapture log;
+        MessagePtr message = call("org.bluez.Agent", c.member);
+        EXPECT_EQ(Agent::handlerDispatcher(nullptr, message.get(), &agent), c.result);
+        EXPECT_EQ(log.lines(), std::vector<std::string>{ c.line });
+    }
+}
+
+TEST(AnAgentsDispatcher, ChecksTheArgumentTypesNotOnlyTheirNumber) {
+    LogCapture log;
+    Agent agent;
+    MessagePtr message = call("org.bluez.Agent", "RequestConfirmation");
+    const char* device = "/org/bluez/1/hci0/dev_00_11_22_33_44_55";
+    const char* notANumber = "482913";
+    dbus_message_append_args(message.get(), DBUS_TYPE_OBJECT_PATH, &device, DBUS_TYPE_STRING,
+                             &notANumber, DBUS_TYPE_INVALID);
+    EXPECT_EQ(Agent::handlerDispatcher(nullptr, message.get(), &agent),
+              DBUS_HANDLER_RESULT_NOT_YET_HANDLED);
+    EXPECT_EQ(log.count("agent.cpp:252 Failed to get argument from request confirmation message."), 1u);
+}
+
+TEST(AnAgentsDispatcher, AnswersWellFormedRequestsAndLeavesEveryOtherMessageUnhandled) {
+    Agent agent;
+    const char* device = "/org/bluez/1/hci0/dev_00_11_22_33_44_55";
+    {
+        LogCapture log;
+        MessagePtr pin = call("org.bluez.Agent", "RequestPinCode");
+        dbus_message_append_args(pin.get(), DBUS_TYPE_OBJECT_PATH, &device, DBUS_TYPE_INVALID);
+        EXPECT_EQ(Agent::handlerDispatcher(nullptr, pin.get(), &agent), DBUS_HANDLER_RESULT_HANDLED);
+        MessagePtr cancel = call("org.bluez.Agent", "Cancel");
+        EXPECT_EQ(Agent::handlerDispatcher(nullptr, cancel.get(), &agent), DBUS_HANDLER_RESULT_HANDLED);
+        MessagePtr release = call("org.bluez.Agent", "Release");
+        EXPECT_EQ(Agent::handlerDispatcher(nullptr, release.get(), &agent), DBUS_HANDLER_RESULT_HANDLED);
+        EXPECT_TRUE(log.lines().empty());
+    }
+    const char* const kNotHandled[][2] = {
+        { "org.bluez.Agent", "DisplayPasskey" },     { "org.bluez.Agent", "ConfirmModeChange" },
+        { "org.bluez.Agent", "DisplayPinCode" },     { "org.bluez.Adapter", "RequestPinCode" },
+        { "org.example.Other", "Release" },
+    };
+    for (const auto& what : kNotHandled) {
+        SCOPED_TRACE(std::string(what[0]) + "." + what[1]);
+        LogCapture log;
+        MessagePtr message = call(what[0], what[1]);
+        EXPECT_EQ(Agent::handlerDispatcher(nullptr, message.get(), &agent),
+                  DBUS_HANDLER_RESULT_NOT_YET_HANDLED);
+        EXPECT_EQ(log.lines(), std::vector<std::string>{
+                                   "agent.cpp:410 Registered agent does not provide a handler for "
+                                   "the incoming message." });
+    }
+    LogCapture log;
+    EXPECT_EQ(Agent::handlerDispatcher(nullptr, nullptr, &agent), DBUS_HANDLER_RESULT_NOT_YET_HANDLED);
+    MessagePtr orphan = call("org.bluez.Agent", "Release");
+    EXPECT_EQ(Agent::handlerDispatcher(nullptr, orphan.get(), nullptr), DBUS_HANDLER_RESULT_NOT_YET_HANDLED);
+    EXPECT_EQ(log.lines().size(), 2u);
+}
+
+TEST(AnAgentsHandlers, ReportAMessageThatCannotBeAnsweredAsNoReplyMessage) {
+    LogCapture log;
+    Agent agent;
+    MessagePtr unsent(dbus_message_new_method_call(":1.1", "/a", "org.bluez.Agent", "Cancel"));
+    EXPECT_EQ(Agent::cancel(nullptr, unsent.get(), &agent), DBUS_HANDLER_RESULT_NEED_MEMORY);
+    agent.setReject(true);
+    EXPECT_EQ(Agent::requestPasskey(nullptr, unsent.get(), &agent), DBUS_HANDLER_RESULT_NOT_YET_HANDLED);
+    MessagePtr passkey = call("org.bluez.Agent", "RequestPasskey");
+    const char* device = "/org/bluez/1/hci0/dev_00_11_22_33_44_55";
+    dbus_message_append_args(passkey.get(), DBUS_TYPE_OBJECT_PATH, &device, DBUS_TYPE_INVALID);
+    EXPECT_EQ(Agent::requestPasskey(nullptr, passkey.get(), &agent), DBUS_HANDLER_RESULT_HANDLED);
+    dbus_message_set_serial(passkey.get(), 0);
+    EXPECT_EQ(Agent::requestPasskey(nullptr, passkey.get(), &agent), DBUS_HANDLER_RESULT_NEED_MEMORY);
+    agent.setReject(false);
+    agent.setPasskeyValue("\xff");  // not UTF-8: cannot be sent as a PIN
+    MessagePtr pin = call("org.bluez.Agent", "RequestPinCode");
+    dbus_message_append_args(pin.get(), DBUS_TYPE_OBJECT_PATH, &device, DBUS_TYPE_INVALID);
+    EXPECT_EQ(Agent::requestPinCode(nullptr, pin.get(), &agent), DBUS_HANDLER_RESULT_NEED_MEMORY);
+    EXPECT_EQ(log.lines(), (std::vector<std::string>{
+                               "agent.cpp:344 Failed to create reply message when handling cancel message.",
+                               "agent.cpp:200 Failed to get argument from request passkey message.",
+                               "agent.cpp:209 Failed to create reply message when handling request passkey message.",
+                               "agent.cpp:173 Failed to create reply message when handling request pin code message." }));
+}
+
+TEST(AnAgent, KeepsTheUndispatchedHandlersResults) {
+    Agent agent;
+    MessagePtr message = call("org.bluez.Agent", "DisplayPasskey");
+    EXPECT_EQ(Agent::displayPasskey(nullptr, message.get(), &agent), DBUS_HANDLER_RESULT_NOT_YET_HANDLED);
+    EXPECT_EQ(Agent::confirmModeChange(nullptr, message.get(), &agent), DBUS_HANDLER_RESULT_HANDLED);
+}
+
+}  // namespace

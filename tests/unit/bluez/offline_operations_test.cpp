@@ -1,0 +1,198 @@
+// Every proxy operation without a bus (the unit tests' bus addresses lead
+// nowhere, so every proxy has a null connection): the result, the error state
+// and the one log line at the operation's own file and line.
+#include <functional>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include <bluetooth/btbus.h>
+
+#include "support/log_capture.h"
+
+namespace {
+
+using namespace Bluetooth;
+using btbus_test::LogCapture;
+
+const char kAdapterPath[] = "/org/bluez/77/hci0";
+const char kDevicePath[] = "/org/bluez/77/hci0/dev_00_11_22_33_44_55";
+
+// The log lines of the proxies' own files (the core's connection lines aside).
+std::vector<std::string> proxyLines(const LogCapture& log) {
+    std::vector<std::string> lines;
+    for (const std::string& line : log.lines())
+        if (line.compare(0, 15, "connection.cpp:") != 0) lines.push_back(line);
+    return lines;
+}
+
+struct Case {
+    const char* name;
+    RemoteObject* object;
+    std::function<bool()> run;  // true when the result says failure
+    std::string logPrefix;      // "" when nothing may be logged
+};
+
+TEST(AProxyWithoutABus, FailsEveryOperationAndLogsItOnceAtItsOwnLine) {
+    Agent agent;
+    const Variant on(true);
+    bool connected = true;
+    std::unique_ptr<Manager> manager(new Manager);
+    std::unique_ptr<Adapter> adapter(new Adapter(kAdapterPath));
+    std::unique_ptr<Device> device(new Device(kDevicePath));
+    std::unique_ptr<Audio> audio(new Audio(kDevicePath));
+    std::unique_ptr<AudioSink> sink(new AudioSink(kDevicePath));
+    std::unique_ptr<Control> control(new Control(kDevicePath));
+    const std::vector<Case> cases = {
+        { "getProperties", device.get(), [&] { return device->getProperties() == nullptr; },
+          "bluez_object.cpp:77 " },
+        { "setProperty", device.get(), [&] { return device->setProperty("Trusted", on) == -1; },
+          "bluez_object.cpp:107 " },
+        { "defaultAdapter", manager.get(), [&] { return manager->defaultAdapter() == nullptr; },
+          "manager.cpp:96 " },
+        { "findAdapter", manager.get(), [&] { return manager->findAdapter("hci0") == nullptr; },
+          "manager.cpp:156 " },
+        { "getAdapterByIndex", manager.get(), [&] { return manager->getAdapterByIndex(0) == nullptr; },
+          "manager.cpp:126 " },
+        { "listAdapters", manager.get(), [&] { return manager->listAdapters() == nullptr; }, "" },
+        { "requestSession", adapter.get(), [&] { return adapter->requestSession() == -1; },
+          "adapter.cpp:83 " },
+        { "releaseSession", adapter.get(), [&] { return adapter->releaseSession() == -1; },
+          "adapter.cpp:105 " },
+        { "startDiscovery", adapter.get(), [&] { return adapter->startDiscovery() == -1; },
+          "adapter.cpp:127 " },
+        { "stopDiscovery", adapter.get(), [&] { return adapter->stopDiscovery() == -1; },
+          "adapter.cpp:149 " },
+        { "findDevice logged", adapter.get(), [&] { return adapter->findDevice("00:11:22:33:44:55", true) == nullptr; },
+          "adapter.cpp:180 " },
+        { "findDevice quiet", adapter.get(), [&] { return adapter->findDevice("00:11:22:33:44:55", false) == nullptr; },
+          "" },
+        { "listDevices", adapter.get(), [&] { return adapter->listDevices() == nullptr; },
+          "adapter.cpp:212 " },
+        { "getDeviceByIndex", adapter.get(), [&] { return adapter->getDeviceByIndex(0) == nullptr; },
+          "adapter.cpp:243 " },
+        { "createDevice", adapter.get(), [&] { return adapter->createDevice("00:11:22:33:44:55") == nullptr; },
+          "adapter.cpp:274 " },
+        { "cancelDeviceCreation", adapter.get(), [&] { return adapter->cancelDeviceCreation("00:11:22:33:44:55") == -1; },
+          "adapter.cpp:337 " },
+        { "removeDevice", adapter.get(), [&] { return adapter->removeDevice(kDevicePath) == -1; },
+          "adapter.cpp:363 " },
+        { "adapter getProperties", adapter.get(), [&] { return adapter->getProperties() == nullptr; },
+          "bluez_object.cpp:77 " },
+        { "discoverServices", device.get(), [&] { return device->discoverServices("") == nullptr; },
+          "device.cpp:64 " },
+        { "cancelDiscovery", device.get(), [&] { return device->cancelDiscovery() == -1; },
+          "device.cpp:85 " },
+        { "Audio::connect", audio.get(), [&] { return audio->connect() == -1; }, "audio.cpp:51 " },
+        { "Audio::disconnect", audio.get(), [&] { return audio->disconnect() == -1; }, "audio.cpp:73 " },
+        { "AudioSink::connect", sink.get(), [&] { return sink->connect() == -1; }, "audio_sink.cpp:58 " },
+        { "AudioSink::disconnect", sink.get(), [&] { return sink->disconnect() == -1; },
+          "audio_sink.cpp:80 " },
+        { "AudioSink::isConnected", sink.get(), [&] { return sink->isConnected(connected) == -1; },
+          "audio_sink.cpp:106 " },
+        { "Control::isConnected", control.get(), [&] { return control->isConnected(connected) == -1; },
+          "control.cpp:60 " },
+        { "volumeDown", control.get(), [&] { return control->volumeDown() == -1; }, "control.cpp:82 " },
+        { "volumeUp", control.get(), [&] { return control->volumeUp() == -1; }, "control.cpp:105 " },
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        LogCapture log;
+        EXPECT_TRUE(c.run());
+        EXPECT_TRUE(c.object->hasError());
+        std::vector<std::string> lines = proxyLines(log);
+        if (c.logPrefix.empty()) {
+            EXPECT_TRUE(lines.empty()) << lines.front();
+        } else {
+            ASSERT_EQ(lines.size(), 1u);
+            EXPECT_EQ(lines[0], c.logPrefix + c.object->getErrorMessage());
+        }
+    }
+    EXPECT_TRUE(connected) << "isConnected wrote its answer although it failed";
+}
+
+TEST(AProxyWithoutABus, RefusesNullAndMalformedArgumentsBeforeSending) {
+    LogCapture log;
+    Adapter adapter(kAdapterPath);
+    EXPECT_EQ(adapter.findDevice(nullptr, true), nullptr);
+    EXPECT_EQ(adapter.getErrorNumber(), 1);
+    EXPECT_EQ(adapter.removeDevice(nullptr), -1);
+    EXPECT_EQ(adapter.getErrorNumber(), 1);
+    EXPECT_EQ(adapter.removeDevice("org/bluez/77/hci0/dev_00_11_22_33_44_55"), -1);
+    EXPECT_EQ(adapter.getErrorNumber(), 3);
+    Agent unregistered;  // its path is still empty
+    EXPECT_EQ(adapter.createPairedDevice("00:11:22:33:44:55", unregistered), nullptr);
+    EXPECT_EQ(adapter.getErrorNumber(), 3);
+    EXPECT_EQ(adapter.registerAgent(unregistered), -1);
+    EXPECT_EQ(adapter.getErrorNumber(), 3);
+    EXPECT_EQ(adapter.unregisterAgent(unregistered), -1);
+    Manager manager;
+    EXPECT_EQ(manager.findAdapter(nullptr), nullptr);
+    EXPECT_EQ(manager.getErrorNumber(), 1);
+    Device device(kDevicePath);
+    EXPECT_EQ(device.setProperty(nullptr, Variant(true)), -1);
+    EXPECT_EQ(device.getErrorNumber(), 1);
+    EXPECT_EQ(device.setProperty("Alias", Variant(-5)), -1);  // signed numbers cannot be written
+    EXPECT_EQ(device.getErrorNumber(), 9);
+    EXPECT_EQ(device.discoverServices(nullptr), nullptr);
+    EXPECT_EQ(device.getErrorNumber(), 1);
+    const std::vector<std::string> expected = {
+        "adapter.cpp:180 Parameter is null", "adapter.cpp:363 Parameter is null",
+        "adapter.cpp:363 Invalid path",      "adapter.cpp:312 Invalid path",
+        "adapter.cpp:393 Invalid path",      "adapter.cpp:419 Invalid path",
+        "manager.cpp:156 Parameter is null", "bluez_object.cpp:107 Parameter is null",
+        "bluez_object.cpp:107 Failed to open container", "device.cpp:64 Parameter is null",
+    };
+    EXPECT_EQ(proxyLines(log), expected);
+}
+
+TEST(AProxyWithoutABus, StartsANewOperationWithAClearedErrorState) {
+    Control control(kDevicePath);
+    bool connected = false;
+    EXPECT_EQ(control.isConnected(connected), -1);
+    EXPECT_EQ(control.getErrorNumber(), 11);
+    EXPECT_EQ(control.volumeUp(), -1);
+    EXPECT_EQ(control.getErrorNumber(), 10) << "volumeUp kept the error of isConnected";
+}
+
+TEST(TheFactoriesWithoutABus, ReturnNullAndListNamesGivesAnEmptyList) {
+    LogCapture log;
+    EXPECT_FALSE(BluezObject::hasBluetoothd());
+    EXPECT_EQ(Manager::getManager(), nullptr);
+    EXPECT_EQ(Adapter::getAdapter(kAdapterPath), nullptr);
+    EXPECT_EQ(Device::getDevice(kDevicePath), nullptr);
+    EXPECT_EQ(Audio::getAudio(kDevicePath), nullptr);
+    EXPECT_EQ(AudioSink::getAudioSink(kDevicePath), nullptr);
+    EXPECT_EQ(Control::getControl(kDevicePath), nullptr);
+    EXPECT_EQ(log.count("dbus_object.cpp:42 No connection to the bus"), 7u);
+    DBusObject bus;
+    std::unique_ptr<std::vector<std::string> > names(bus.listNames());
+    ASSERT_NE(names, nullptr);
+    EXPECT_TRUE(names->empty());
+    EXPECT_EQ(bus.getErrorNumber(), 11);
+}
+
+TEST(TheSignalSettersWithoutABus, ReturnTheRegistrationsFailure) {
+    Manager manager;
+    Adapter adapter(kAdapterPath);
+    Device device(kDevicePath);
+    AudioSink sink(kDevicePath);
+    Control control(kDevicePath);
+    const std::vector<int> results = {
+        manager.setPropertyChangedHandler(nullptr),    manager.setAdapterAddedHandler(nullptr),
+        manager.setAdapterRemovedHandler(nullptr),     manager.setDefaultAdapterChangedHandler(nullptr),
+        adapter.setDeviceFoundHandler(nullptr),        adapter.setDeviceDisappearedHandler(nullptr),
+        adapter.setDeviceCreatedHandler(nullptr),      adapter.setDeviceRemovedHandler(nullptr),
+        device.setDisconnectRequestedHandler(nullptr), sink.setConnectedHandler(nullptr),
+        sink.setDisconnectedHandler(nullptr),          sink.setPlayingHandler(nullptr),
+        sink.setStoppedHandler(nullptr),               control.setConnectedHandler(nullptr),
+        control.setDisconnectedHandler(nullptr),
+    };
+    for (size_t i = 0; i < results.size(); ++i) EXPECT_EQ(results[i], -1) << "setter " << i;
+    EXPECT_TRUE(RemoteObject::signalHandlerVectorNoArgument.empty());
+    EXPECT_TRUE(RemoteObject::signalHandlerVectorObjectPath.empty());
+}
+
+}  // namespace
