@@ -1,7 +1,7 @@
 #!/bin/sh
 # Installs the build into a private prefix, then builds and runs a C++11 user
 # program against it twice: through pkg-config and through the CMake package.
-# Usage: consumer_test.sh BUILD_DIR PREFIX CXX
+# Usage: consumer_test.sh BUILD_DIR PREFIX CXX  (CXXFLAGS from the environment)
 set -eu
 build=$1
 prefix=$2
@@ -22,7 +22,7 @@ soname=$(readelf -d "$libdir/libbtbus.so" | sed -n 's/.*SONAME.*\[\(.*\)\]/\1/p'
 test "$soname" = libbtbus.so.0 || { echo "unexpected SONAME '$soname'"; exit 1; }
 
 # shellcheck disable=SC2046
-"$cxx" -std=c++11 -Wall -Wextra -Werror -o "$prefix/consumer" "$here/consumer.cpp" $(pkg-config --cflags --libs btbus)
+"$cxx" -std=c++11 -Wall -Wextra -Werror ${CXXFLAGS:-} -o "$prefix/consumer" "$here/consumer.cpp" $(pkg-config --cflags --libs btbus)
 LD_LIBRARY_PATH=$libdir "$prefix/consumer"
 
 cmake -S "$here/cmake_consumer" -B "$prefix/cmake-consumer" -DCMAKE_PREFIX_PATH="$prefix" \

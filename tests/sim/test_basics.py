@@ -89,6 +89,19 @@ class BasicsTest(SimTestCase):
         self.assertTrue(self.call(self.adapter, ADAPTER, 'GetProperties')['Powered'])
         self.assertEqual(list(self.call('/', 'org.bluez.Manager', 'ListAdapters')), [self.adapter])
 
+    def test_reset_brings_a_device_back_in_range(self):
+        self.control('SetInRange', 'hci0', HEADSET, False)
+        self.control('Reset')
+        # An out-of-range device could not start a connection.
+        self.assertEqual(self.control('IncomingConnection', 'hci0', HEADSET, '0000110b-0000-1000-8000-00805f9b34fb'),
+                         'org.bluez.Error.AgentNotAvailable')
+
+    def test_unknown_member_is_a_plain_unknown_method_error(self):
+        mouse = self.adapter + '/dev_00_1F_20_AB_CD_EF'
+        error = self.assert_error('org.freedesktop.DBus.Error.UnknownMethod', mouse, 'org.bluez.AudioSink', 'IsConnected')
+        self.assertEqual(error.get_dbus_message(),
+                         'Method "IsConnected" on interface "org.bluez.AudioSink" doesn\'t exist')
+
     def test_add_adapter_signal_order(self):
         path = self.control('AddAdapter', 'hci1', '00:11:22:33:44:01')
         self.assertTrue(re.match(r'/org/bluez/\d+/hci1$', path))

@@ -73,9 +73,9 @@ class ControlPanel:
     def SetInRange(self, call, adapter_name, address, in_range):
         adapter = self.sim.adapter(adapter_name)
         dev = adapter.find(address)
-        if dev.info.in_range == bool(in_range):
+        if dev.in_range == bool(in_range):
             return
-        dev.info.in_range = bool(in_range)
+        dev.in_range = bool(in_range)
         if in_range:
             adapter.report_found(dev)
             return
@@ -93,7 +93,7 @@ class ControlPanel:
         if not adapter.powered:
             raise bluez_error('NotReady')
         dev = adapter.find(address)
-        if not dev.info.in_range:
+        if not dev.in_range:
             raise bluez_error('NotAvailable', 'Device is out of range')
         return adapter, dev
 

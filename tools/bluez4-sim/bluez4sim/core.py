@@ -555,7 +555,7 @@ class Adapter:
         self.found_now = set()
         self.changed('Discovering', 'b', True)
         for dev in self.devices.values():
-            if dev.info.in_range:
+            if dev.in_range:
                 self.report_found(dev)
         self.round_timer = self.sim.later(self.sim.options['round_seconds'], self._end_round)
 
@@ -631,6 +631,7 @@ class Device:
         self.path = f'{adapter.path}/dev_{info.address.replace(":", "_")}'
         self.alias = info.alias
         self.paired, self.trusted, self.blocked = info.paired, info.trusted, info.blocked
+        self.in_range = info.in_range  # live state: the scene's value stays for Reset
         self.exported = False
         self.temporary = False
         self.connected = False
@@ -824,7 +825,7 @@ class Device:
         if has_sink:
             self.set_sink_state('connecting')
         self.set_audio_state('connecting')
-        if not self.info.in_range:
+        if not self.in_range:
             self.audio_timer = self.sim.later(self.sim.options['connect_seconds'], self._audio_failed, call, whole)
             return PENDING
         self.link_up()

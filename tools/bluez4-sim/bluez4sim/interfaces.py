@@ -13,6 +13,24 @@ from .core import (PENDING, Agent, Pairing, bluez_error, check_address)
 from .values import basic_signature_of, props_dict
 
 
+def _plain_unknown_method(lookup):
+    """Answer a call to a member an object lacks as the daemon does: a plain
+    UnknownMethod error, without the traceback dbus-python attaches to it."""
+    def method_lookup(obj, name, interface):
+        try:
+            return lookup(obj, name, interface)
+        except dbus.exceptions.UnknownMethodException:
+            raise dbus.exceptions.DBusException(
+                f'Method "{name}" on interface "{interface}" doesn\'t exist',
+                name='org.freedesktop.DBus.Error.UnknownMethod') from None
+    method_lookup.plain_unknown_method = True
+    return method_lookup
+
+
+if not getattr(dbus.service._method_lookup, 'plain_unknown_method', False):  # pylint: disable=protected-access
+    dbus.service._method_lookup = _plain_unknown_method(dbus.service._method_lookup)  # pylint: disable=protected-access
+
+
 class ManagerInterface:
     METHODS = [('GetProperties', '', 'a{sv}'), ('DefaultAdapter', '', 'o'),
                ('FindAdapter', 's', 'o'), ('ListAdapters', '', 'ao')]
@@ -137,7 +155,7 @@ class AdapterInterface:
         if dev.exported:
             raise bluez_error('AlreadyExists')
         dev.create_object()
-        if not dev.info.in_range:
+        if not dev.in_range:
             call.fail(bluez_error('Failed', 'Host is down'))
             dev.remove_object()
             return PENDING
@@ -162,7 +180,7 @@ class AdapterInterface:
         if dev.paired:
             raise bluez_error('AlreadyExists')
         dev.create_object()
-        if not dev.info.in_range:
+        if not dev.in_range:
             call.fail(bluez_error('ConnectionAttemptFailed', 'Page Timeout'))
             self.sim.send_agent(agent, 'Release')
             dev.link_down()
@@ -258,7 +276,7 @@ class DeviceInterface:
         uuid = sc.service_pattern(pattern)
         if uuid is None:
             raise bluez_error('InvalidArguments')
-        if not dev.info.in_range:
+        if not dev.in_range:
             raise bluez_error('ConnectionAttemptFailed', 'Host is down')
         records = {handle: xml for handle, xml in dev.info.services.items()
                    if not uuid or uuid in sc.record_classes(xml)}
