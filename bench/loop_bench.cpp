@@ -211,14 +211,18 @@ int main(int argc, char** argv) {
     setenv("DBUS_SESSION_BUS_ADDRESS", address.c_str(), 1);
 
     DBusConnection* peer = privateConnection();
-    dbus_bus_request_name(peer, kService, 0, nullptr);
-    std::thread peerThread(servePeer, peer);
     DBusConnection* emitter = privateConnection();
-
-    // The caller's shared connection, and a second one for the blind loop.
-    Bluetooth::RemoteObject caller(kService, kPath, kInterface, DBUS_BUS_SESSION);
     DBusConnection* rawCaller = privateConnection();
     DBusConnection* blind = privateConnection();
+    // The caller's shared connection; the blind loop has one of its own.
+    Bluetooth::RemoteObject caller(kService, kPath, kInterface, DBUS_BUS_SESSION);
+    if (!peer || !emitter || !rawCaller || !blind || !caller.getConnection()) {
+        std::fprintf(stderr, "cannot connect to the private bus at %s\n", address.c_str());
+        stopBus();
+        return 1;
+    }
+    dbus_bus_request_name(peer, kService, 0, nullptr);
+    std::thread peerThread(servePeer, peer);
     std::string rule = std::string("type='signal',interface='") + kInterface + "'";
     dbus_bus_add_match(blind, rule.c_str(), nullptr);
 
