@@ -27,7 +27,6 @@ using btbus_test::sim::kPhone;
 using btbus_test::sim::kFarLaptop;
 using btbus_test::sim::kMouse;
 
-
 class AnAdapter : public SimTest {
 protected:
     void SetUp() override {

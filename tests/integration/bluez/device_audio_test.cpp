@@ -22,7 +22,6 @@ namespace sim = btbus_test::sim;
 using btbus_test::sim::kHeadset;
 using btbus_test::sim::kMouse;
 
-
 class ADevice : public SimTest {
 protected:
     void SetUp() override {
