@@ -195,9 +195,11 @@ private:
     std::string matchRule(const std::string& signalName) const;
     void releaseReply();
     void releaseMessage();
-    // Checks that a reply is present (error 2 otherwise) and opens an iterator
-    // on its arguments; the reply is handed to holder, which releases it.
-    bool takeReply(DBusMessage*& holder, DBusMessageIter& iterator);
+    // Takes the reply out of this object (the caller releases it) and opens an
+    // iterator on its arguments; with no reply present, error 2 and null.
+    DBusMessage* takeReply(DBusMessageIter& iterator);
+    // Why nothing can be sent now (no connection, no message), or null.
+    const char* cannotSend() const;
     int readStringArray(std::vector<std::string>& values);
     // Appends the entries of a dictionary array to dict, up to an entry with an
     // empty name; says which part of an entry could not be decoded.

@@ -5,14 +5,12 @@
 #include <csignal>
 #include <chrono>
 #include <condition_variable>
-#include <cstdio>
 #include <iostream>
 #include <mutex>
 #include <sstream>
 
 #include <fcntl.h>
 #include <poll.h>
-#include <sched.h>
 #include <unistd.h>
 
 #include <bluetooth/connection.h>
@@ -276,11 +274,6 @@ DBusMessage* callThroughLoop(LoopState* loop, DBusConnection* connection, DBusMe
 
 // ---- pending calls ----
 
-struct PendingState {
-    RemoteObject* object;
-    std::atomic<bool> claimed;  // the reply is taken once, by the notify or by the waiter
-};
-
 void onInterrupt(int) { gFlags[kInterrupted] = 1; }
 
 void installInterruptHandlers() {
@@ -291,8 +284,6 @@ void installInterruptHandlers() {
     sigaction(SIGTERM, &action, 0);
     sigaction(SIGINT, &action, 0);
 }
-
-void freePendingState(void* data) { delete static_cast<PendingState*>(data); }
 
 // ---- reading replies ----
 
@@ -504,8 +495,7 @@ int RemoteObject::sendMessage(bool waitReply, int timeout) {
     releaseReply();
     ScopedError error;
     int result = 0;
-    if (connection == 0 || message == 0) {
-        const char* why = connection == 0 ? "No connection to the bus" : "No message to send";
+    if (const char* why = cannotSend()) {
         result = waitReply ? fail(kBusError, why) : fail(10);
     } else if (waitReply) {
         // libdbus aborts on a time-out below -1; those mean its default as well.
@@ -538,51 +528,41 @@ int RemoteObject::setReplyMessage(DBusMessage* newReply) {
 
 namespace {
 
-// Runs on whichever thread dispatches the reply.
-void onPendingReply(DBusPendingCall* pending, void* data) {
-    PendingState* state = static_cast<PendingState*>(data);
-    if (state->claimed.exchange(true)) return;
-    state->object->setReplyMessage(dbus_pending_call_steal_reply(pending));
-    gFlags[kReplyArrived] = 1;
-}
+// Runs on whichever thread dispatches the reply; the waiting thread takes it.
+void onPendingReply(DBusPendingCall*, void*) { gFlags[kReplyArrived] = 1; }
 
 }  // namespace
+
+const char* RemoteObject::cannotSend() const {
+    if (connection == 0) return "No connection to the bus";
+    return message == 0 ? "No message to send" : 0;
+}
 
 int RemoteObject::sendMessagePending() {
     ScopedError error;
     releaseReply();
     int result = 0;
     DBusPendingCall* pending = 0;
-    if (connection == 0 || message == 0) {
-        result = fail(kBusError, connection == 0 ? "No connection to the bus" : "No message to send");
+    if (const char* why = cannotSend()) {
+        result = fail(kBusError, why);
     } else if (!dbus_connection_send_with_reply(connection, message, &pending, -1)) {
         result = fail(kBusError, error.text());  // libdbus sets no error text here
     } else {
-        PendingState* state = 0;
-        if (pending != 0) {
-            state = new PendingState;
-            state->object = this;
-            state->claimed = false;
-            dbus_pending_call_set_notify(pending, &onPendingReply, state,
-                                         &freePendingState);
-            // Another thread may have dispatched the reply before the notify was set.
-            if (dbus_pending_call_get_completed(pending)) onPendingReply(pending, state);
-        }
+        if (pending != 0) dbus_pending_call_set_notify(pending, &onPendingReply, 0, 0);
         dbus_connection_flush(connection);
         installInterruptHandlers();
-        while (!gFlags[kInterrupted] && !gFlags[kReplyArrived]) {
+        // The call itself is asked too: another thread may have dispatched the
+        // reply before the notify was set.
+        while (!gFlags[kInterrupted] && !(pending != 0 && dbus_pending_call_get_completed(pending))) {
             bool open = dbus_connection_read_write_dispatch(connection, 500);
             ++gDispatches;
             if (!open) break;
         }
         if (pending != 0) {
-            // Claim the reply so that a late notify cannot touch this object after
-            // the call returned; if the notify is running, let it finish.
-            if (state->claimed.exchange(true)) {
-                while (!gFlags[kReplyArrived]) sched_yield();
-            } else {
-                dbus_pending_call_cancel(pending);
-            }
+            if (dbus_pending_call_get_completed(pending))
+                setReplyMessage(dbus_pending_call_steal_reply(pending));  // none gives error 2
+            else
+                dbus_pending_call_cancel(pending);  // no reply can arrive for it later
             dbus_pending_call_unref(pending);
         }
     }
@@ -594,32 +574,29 @@ int RemoteObject::sendMessagePending() {
 
 // ---- reading replies ----
 
-bool RemoteObject::takeReply(DBusMessage*& holder, DBusMessageIter& iterator) {
-    if (reply == 0) {
-        fail(2);
-        return false;
-    }
-    holder = reply;
+DBusMessage* RemoteObject::takeReply(DBusMessageIter& iterator) {
+    DBusMessage* taken = reply;
     reply = 0;
-    dbus_message_iter_init(holder, &iterator);
-    return true;
+    if (taken != 0)
+        dbus_message_iter_init(taken, &iterator);
+    else
+        fail(2);
+    return taken;
 }
 
 int RemoteObject::getReplyValue(std::string& value) {
-    DBusMessage* taken = 0;
     DBusMessageIter arguments;
-    if (!takeReply(taken, arguments)) return -1;
-    MessagePtr hold(taken);
+    MessagePtr taken(takeReply(arguments));
+    if (!taken) return -1;
     if (basicTypeOf(arguments) != DBUS_TYPE_STRING) return fail(4);
     value = readText(arguments);
     return 0;
 }
 
 int RemoteObject::getReplyValue(bool& value) {
-    DBusMessage* taken = 0;
     DBusMessageIter arguments;
-    if (!takeReply(taken, arguments)) return -1;
-    MessagePtr hold(taken);
+    MessagePtr taken(takeReply(arguments));
+    if (!taken) return -1;
     if (basicTypeOf(arguments) != DBUS_TYPE_BOOLEAN) return fail(4);
     dbus_bool_t truth = FALSE;
     dbus_message_iter_get_basic(&arguments, &truth);
@@ -628,10 +605,9 @@ int RemoteObject::getReplyValue(bool& value) {
 }
 
 int RemoteObject::getReplyValue(ObjectPath& value) {
-    DBusMessage* taken = 0;
     DBusMessageIter arguments;
-    if (!takeReply(taken, arguments)) return -1;
-    MessagePtr hold(taken);
+    MessagePtr taken(takeReply(arguments));
+    if (!taken) return -1;
     int type = basicTypeOf(arguments);
     if (type == DBUS_TYPE_OBJECT_PATH) {
         value = ObjectPath(readText(arguments));
@@ -647,10 +623,9 @@ int RemoteObject::getReplyValue(ObjectPath& value) {
 }
 
 int RemoteObject::readStringArray(std::vector<std::string>& values) {
-    DBusMessage* taken = 0;
     DBusMessageIter arguments;
-    if (!takeReply(taken, arguments)) return -1;
-    MessagePtr hold(taken);
+    MessagePtr taken(takeReply(arguments));
+    if (!taken) return -1;
     if (basicTypeOf(arguments) != DBUS_TYPE_ARRAY) return fail(4);
     values.clear();
     return readTexts(arguments, values) ? 0 : fail(4);
@@ -667,10 +642,9 @@ int RemoteObject::getReplyValue(std::vector<ObjectPath>& values) {
 }
 
 int RemoteObject::getReplyValue(Dict& dict) {
-    DBusMessage* taken = 0;
     DBusMessageIter arguments;
-    if (!takeReply(taken, arguments)) return -1;
-    MessagePtr hold(taken);
+    MessagePtr taken(takeReply(arguments));
+    if (!taken) return -1;
     if (basicTypeOf(arguments) != DBUS_TYPE_ARRAY ||
         dbus_message_iter_get_element_type(&arguments) != DBUS_TYPE_DICT_ENTRY)
         return fail(5);
@@ -1008,8 +982,9 @@ void* receiveSignal(void* data) {
         if (waitReadable(connection, state, 100, true)) {
             dbus_connection_read_write(connection, 0);
             // Data on the socket that this thread could not read: another thread
-            // holds the I/O path inside a blocking call and will read it. Rather
-            // than spin on the socket, wait for that thread to queue messages.
+            // holds the I/O path (a pending call's wait, or a blocking call in
+            // libdbus's own wait) and will read it. Rather than spin on the
+            // socket, wait for that thread to queue messages.
             if (dbus_connection_get_dispatch_status(connection) == DBUS_DISPATCH_COMPLETE)
                 waitReadable(connection, state, kBackOffMs, false);
         } else {
