@@ -26,21 +26,20 @@ namespace {
 using internal::Op;
 using internal::kNoReply;
 
-const Op kRequestSession = { "RequestSession", false, 83 };
-const Op kReleaseSession = { "ReleaseSession", false, 105 };
-const Op kStartDiscovery = { "StartDiscovery", false, 127 };
-const Op kStopDiscovery = { "StopDiscovery", false, 149 };
+const Op kRequestSession = { "RequestSession", internal::kOneWay, 83 };
+const Op kReleaseSession = { "ReleaseSession", internal::kOneWay, 105 };
+const Op kStartDiscovery = { "StartDiscovery", internal::kOneWay, 127 };
+const Op kStopDiscovery = { "StopDiscovery", internal::kOneWay, 149 };
 const char kFindDevice[] = "FindDevice";
 const int kFindDeviceLogLine = 180;
-const Op kListDevices = { "ListDevices", true, 212 };
-const Op kListDevicesByIndex = { "ListDevices", true, 243 };
-const Op kCreateDevice = { "CreateDevice", true, 274 };
-const char kCreatePairedDevice[] = "CreatePairedDevice";
-const int kCreatePairedDeviceLogLine = 312;
-const Op kCancelDeviceCreation = { "CancelDeviceCreation", false, 337 };
-const Op kRemoveDevice = { "RemoveDevice", false, 363 };
-const Op kRegisterAgent = { "RegisterAgent", false, 393 };
-const Op kUnregisterAgent = { "UnregisterAgent", false, 419 };
+const Op kListDevices = { "ListDevices", internal::kWaitReply, 212 };
+const Op kListDevicesByIndex = { "ListDevices", internal::kWaitReply, 243 };
+const Op kCreateDevice = { "CreateDevice", internal::kWaitReply, 274 };
+const Op kCreatePairedDevice = { "CreatePairedDevice", internal::kPending, 312 };
+const Op kCancelDeviceCreation = { "CancelDeviceCreation", internal::kOneWay, 337 };
+const Op kRemoveDevice = { "RemoveDevice", internal::kOneWay, 363 };
+const Op kRegisterAgent = { "RegisterAgent", internal::kOneWay, 393 };
+const Op kUnregisterAgent = { "UnregisterAgent", internal::kOneWay, 419 };
 const int kHciconfigLogLine = 438;
 
 enum { kFound, kDisappeared, kCreated, kRemoved };
@@ -130,7 +129,7 @@ int Adapter::startDiscovery() { return internal::call(*this, kLogFile, kStartDis
 int Adapter::stopDiscovery() { return internal::call(*this, kLogFile, kStopDiscovery, kNoReply); }
 
 Device* Adapter::findDevice(const char* address, bool logError) {
-    const Op op = { kFindDevice, true, logError ? kFindDeviceLogLine : internal::kSilent };
+    const Op op = { kFindDevice, internal::kWaitReply, logError ? kFindDeviceLogLine : internal::kSilent };
     ObjectPath path;
     if (internal::call(*this, kLogFile, op, &path, address) != 0) return 0;
     return Device::getDevice(path);
@@ -143,19 +142,11 @@ Device* Adapter::createDevice(const char* address) {
 }
 
 Device* Adapter::createPairedDevice(const char* address, const Agent& agent) {
-    // By hand: the one call sent with sendMessagePending, which dispatches the
-    // connection on this thread so that the agent can answer meanwhile.
-    resetError();
     ObjectPath path;
-    int result = newMessage(kCreatePairedDevice);
-    if (result == 0)
-        result = internal::appendAll(*this, address, ObjectPath(agent.getPath()),
-                                     agent.getCapability());
-    if (result == 0) result = sendMessagePending();
-    if (result == 0) result = getReplyValue(path);
-    if (hasError())
-        internal::logError(kLogFile, kCreatePairedDeviceLogLine, "%s", getErrorMessage().c_str());
-    return result == 0 ? Device::getDevice(path) : 0;
+    if (internal::call(*this, kLogFile, kCreatePairedDevice, &path, address,
+                       ObjectPath(agent.getPath()), agent.getCapability()) != 0)
+        return 0;
+    return Device::getDevice(path);
 }
 
 int Adapter::cancelDeviceCreation(const char* address) {
@@ -163,14 +154,7 @@ int Adapter::cancelDeviceCreation(const char* address) {
 }
 
 int Adapter::removeDevice(const char* devicePath) {
-    if (devicePath == 0) {
-        // ObjectPath cannot hold a null text; report it as any null argument.
-        resetError();
-        fail(1);
-        internal::logError(kLogFile, kRemoveDevice.logLine, "%s", getErrorMessage().c_str());
-        return -1;
-    }
-    return internal::call(*this, kLogFile, kRemoveDevice, kNoReply, ObjectPath(devicePath));
+    return internal::call(*this, kLogFile, kRemoveDevice, kNoReply, internal::PathText(devicePath));
 }
 
 int Adapter::registerAgent(const Agent& agent) {

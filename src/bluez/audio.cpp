@@ -7,8 +7,8 @@ BT_LOG_FILE("audio.cpp");
 namespace Bluetooth {
 
 namespace {
-const internal::Op kConnect = { "Connect", false, 51 };
-const internal::Op kDisconnect = { "Disconnect", false, 73 };
+const internal::Op kConnect = { "Connect", internal::kOneWay, 51 };
+const internal::Op kDisconnect = { "Disconnect", internal::kOneWay, 73 };
 }  // namespace
 
 Audio::Audio(const char* path) : BluezObject(path, "org.bluez.Audio") {}

@@ -9,9 +9,9 @@ namespace Bluetooth {
 
 namespace {
 
-const internal::Op kConnect = { "Connect", false, 58 };
-const internal::Op kDisconnect = { "Disconnect", false, 80 };
-const internal::Op kIsConnected = { "IsConnected", true, 106 };
+const internal::Op kConnect = { "Connect", internal::kOneWay, 58 };
+const internal::Op kDisconnect = { "Disconnect", internal::kOneWay, 80 };
+const internal::Op kIsConnected = { "IsConnected", internal::kWaitReply, 106 };
 
 enum { kConnected, kDisconnected, kPlaying, kStopped };
 const internal::SignalLine kSignals[] = {

@@ -17,8 +17,8 @@ namespace {
 
 using internal::Op;
 
-const Op kGetProperties = { "GetProperties", true, 77 };
-const Op kSetProperty = { "SetProperty", false, 107 };
+const Op kGetProperties = { "GetProperties", internal::kWaitReply, 77 };
+const Op kSetProperty = { "SetProperty", internal::kOneWay, 107 };
 
 const internal::SignalLine kPropertyChanged = { "PropertyChanged", "", " was changed in ",
                                                 " with " };

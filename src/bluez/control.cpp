@@ -9,9 +9,9 @@ namespace Bluetooth {
 
 namespace {
 
-const internal::Op kIsConnected = { "IsConnected", true, 60 };
-const internal::Op kVolumeDown = { "VolumeDown", false, 82 };
-const internal::Op kVolumeUp = { "VolumeUp", false, 105 };
+const internal::Op kIsConnected = { "IsConnected", internal::kWaitReply, 60 };
+const internal::Op kVolumeDown = { "VolumeDown", internal::kOneWay, 82 };
+const internal::Op kVolumeUp = { "VolumeUp", internal::kOneWay, 105 };
 
 enum { kConnected, kDisconnected };
 const internal::SignalLine kSignals[] = {

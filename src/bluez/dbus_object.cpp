@@ -7,7 +7,7 @@ BT_LOG_FILE("dbus_object.cpp");
 namespace Bluetooth {
 
 namespace {
-const internal::Op kListNames = { "ListNames", true, 42 };
+const internal::Op kListNames = { "ListNames", internal::kWaitReply, 42 };
 }
 
 DBusObject::DBusObject()

@@ -11,8 +11,8 @@ namespace Bluetooth {
 
 namespace {
 
-const internal::Op kDiscoverServices = { "DiscoverServices", true, 64 };
-const internal::Op kCancelDiscovery = { "CancelDiscovery", false, 85 };
+const internal::Op kDiscoverServices = { "DiscoverServices", internal::kWaitReply, 64 };
+const internal::Op kCancelDiscovery = { "CancelDiscovery", internal::kOneWay, 85 };
 
 const internal::SignalLine kDisconnectRequested = { "DisconnectRequested",
                                                     "Disconnect requested from ", "", "" };

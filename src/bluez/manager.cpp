@@ -13,9 +13,9 @@ namespace {
 
 using internal::Op;
 
-const Op kDefaultAdapter = { "DefaultAdapter", true, 96 };
-const Op kFindAdapter = { "FindAdapter", true, 156 };
-const Op kListAdaptersByIndex = { "ListAdapters", true, 126 };
+const Op kDefaultAdapter = { "DefaultAdapter", internal::kWaitReply, 96 };
+const Op kFindAdapter = { "FindAdapter", internal::kWaitReply, 156 };
+const Op kListAdaptersByIndex = { "ListAdapters", internal::kWaitReply, 126 };
 
 enum { kAdded, kRemoved, kDefaultChanged };
 // deliberate: "adpater" is misspelt in the output.

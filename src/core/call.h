@@ -8,15 +8,37 @@
 namespace Bluetooth {
 namespace internal {
 
-// One proxy operation: its method, whether it waits for the reply, and the line
-// its failure is logged at (pinned: it is part of the log's contract); kSilent
-// for an operation whose caller asked for no log line.
+// How an operation sends its call: without waiting (a refusal is never seen),
+// blocking for the reply, or pending while this thread keeps dispatching the
+// connection (so that the process's own agent can answer meanwhile).
+enum Send { kOneWay, kWaitReply, kPending };
+
+// One proxy operation: its method, how it sends, and the line its failure is
+// logged at (pinned: it is part of the log's contract); kSilent for an
+// operation whose caller asked for no log line.
 enum { kSilent = 0 };
 struct Op {
     const char* method;
-    bool wait;
+    Send send;
     int logLine;
 };
+
+// An object-path argument given as text that may be null: null is reported
+// as error 1, like any null argument, since an ObjectPath cannot hold it.
+struct PathText {
+    explicit PathText(const char* text) : text(text) {}
+    const char* text;
+};
+
+template <typename A>
+int appendOne(RemoteObject& object, const A& value) {
+    return object.append(value);
+}
+
+inline int appendOne(RemoteObject& object, const PathText& path) {
+    return path.text != 0 ? object.append(ObjectPath(path.text))
+                          : object.append(static_cast<const char*>(0));
+}
 
 // Output type of operations that read no reply.
 struct NoReply {};
@@ -26,7 +48,7 @@ inline int appendAll(RemoteObject&) { return 0; }
 
 template <typename A, typename... Rest>
 int appendAll(RemoteObject& object, const A& first, const Rest&... rest) {
-    if (object.append(first) != 0) return -1;  // stops at the first failure
+    if (appendOne(object, first) != 0) return -1;  // stops at the first failure
     return appendAll(object, rest...);
 }
 
@@ -46,8 +68,10 @@ int call(RemoteObject& object, const char* file, const Op& op, Out* out, const A
     object.resetError();
     int result = object.newMessage(op.method);
     if (result == 0) result = appendAll(object, args...);
-    if (result == 0) result = object.sendMessage(op.wait, -1);
-    if (result == 0 && op.wait) result = readReply(object, out);
+    if (result == 0)
+        result = op.send == kPending ? object.sendMessagePending()
+                                     : object.sendMessage(op.send == kWaitReply, -1);
+    if (result == 0 && op.send != kOneWay) result = readReply(object, out);
     if (object.hasError() && op.logLine != kSilent)
         logError(file, op.logLine, "%s", object.getErrorMessage().c_str());
     return result;
