@@ -54,8 +54,6 @@ const internal::SignalLine kSignals[] = {
 const char kHciconfig[] = "/usr/bin/hciconfig";
 const char kHciVersionKey[] = "HCIVersion";
 
-const char* textOf(const ObjectPath* path) { return path != 0 ? path->c_str() : 0; }
-
 // The last component of an object path: the controller's name ("hci0").
 std::string controllerName(const std::string& path) {
     std::string::size_type slash = path.rfind('/');
@@ -237,11 +235,11 @@ void Adapter::deviceDisappearedHandler(RemoteObject* object, const char* address
 }
 
 void Adapter::deviceCreatedHandler(RemoteObject* object, const ObjectPath* path) {
-    internal::printLine(kSignals[kCreated], textOf(path), object);
+    internal::printLine(kSignals[kCreated], path, object);
 }
 
 void Adapter::deviceRemovedHandler(RemoteObject* object, const ObjectPath* path) {
-    internal::printLine(kSignals[kRemoved], textOf(path), object);
+    internal::printLine(kSignals[kRemoved], path, object);
 }
 
 }  // namespace Bluetooth

@@ -25,8 +25,6 @@ const internal::SignalLine kSignals[] = {
     { "DefaultAdapterChanged", "Default adpater is ", " in ", " now" },
 };
 
-const char* textOf(const ObjectPath* path) { return path != 0 ? path->c_str() : 0; }
-
 }  // namespace
 
 AdapterList::~AdapterList() {
@@ -85,15 +83,15 @@ int Manager::setDefaultAdapterChangedHandler(AdapterPathHandler handler) {
 }
 
 void Manager::adapterAddedHandler(RemoteObject* object, const ObjectPath* path) {
-    internal::printLine(kSignals[kAdded], textOf(path), object);
+    internal::printLine(kSignals[kAdded], path, object);
 }
 
 void Manager::adapterRemovedHandler(RemoteObject* object, const ObjectPath* path) {
-    internal::printLine(kSignals[kRemoved], textOf(path), object);
+    internal::printLine(kSignals[kRemoved], path, object);
 }
 
 void Manager::defaultAdapterChangedHandler(RemoteObject* object, const ObjectPath* path) {
-    internal::printLine(kSignals[kDefaultChanged], textOf(path), object);
+    internal::printLine(kSignals[kDefaultChanged], path, object);
 }
 
 }  // namespace Bluetooth

@@ -37,5 +37,9 @@ void printLine(const SignalLine& line, const char* argument, RemoteObject* proxy
     std::cout << std::endl;
 }
 
+void printLine(const SignalLine& line, const ObjectPath* argument, RemoteObject* proxy) {
+    printLine(line, argument != 0 ? argument->c_str() : 0, proxy);
+}
+
 }  // namespace internal
 }  // namespace Bluetooth

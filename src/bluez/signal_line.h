@@ -23,6 +23,8 @@ void printLine(const SignalLine& line, RemoteObject* proxy);
 // Signals with an argument: lead, argument, link, path, tail, extra.
 void printLine(const SignalLine& line, const char* argument, RemoteObject* proxy,
                const char* extra = "");
+// Signals with an object path as argument.
+void printLine(const SignalLine& line, const ObjectPath* argument, RemoteObject* proxy);
 
 }  // namespace internal
 }  // namespace Bluetooth
