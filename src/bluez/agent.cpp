@@ -129,8 +129,8 @@ DBusHandlerResult answer(DBusConnection* connection, DBusMessage* message, Agent
         if (dbus_message_get_serial(message) != 0)
             reply = dbus_message_new_error(message, kRejected, "");
         if (reply == 0) {
-            // The library this replaces went on to send the missing message,
-            // which libdbus refuses; nothing would reach BlueZ either way.
+            // Nothing can be sent: BlueZ gets no answer, as with any reply
+            // that could not be made.
             logNoReply(request, request.noErrorLine);
             return kNeedMemory;
         }
