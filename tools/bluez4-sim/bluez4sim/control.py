@@ -10,7 +10,7 @@ import dbus
 import dbus.lowlevel
 
 from . import scene as sc
-from .core import PENDING, Device, Pairing, bluez_error, check_address
+from .core import PENDING, Device, Pairing, bluez_error
 from .values import ConversionError, args_to_dbus
 
 CONTROL_PATH = '/org/btbus/Simulator'
