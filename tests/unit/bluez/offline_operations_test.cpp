@@ -174,25 +174,4 @@ TEST(TheFactoriesWithoutABus, ReturnNullAndListNamesGivesAnEmptyList) {
     EXPECT_EQ(bus.getErrorNumber(), 11);
 }
 
-TEST(TheSignalSettersWithoutABus, ReturnTheRegistrationsFailure) {
-    Manager manager;
-    Adapter adapter(kAdapterPath);
-    Device device(kDevicePath);
-    AudioSink sink(kDevicePath);
-    Control control(kDevicePath);
-    const std::vector<int> results = {
-        manager.setPropertyChangedHandler(nullptr),    manager.setAdapterAddedHandler(nullptr),
-        manager.setAdapterRemovedHandler(nullptr),     manager.setDefaultAdapterChangedHandler(nullptr),
-        adapter.setDeviceFoundHandler(nullptr),        adapter.setDeviceDisappearedHandler(nullptr),
-        adapter.setDeviceCreatedHandler(nullptr),      adapter.setDeviceRemovedHandler(nullptr),
-        device.setDisconnectRequestedHandler(nullptr), sink.setConnectedHandler(nullptr),
-        sink.setDisconnectedHandler(nullptr),          sink.setPlayingHandler(nullptr),
-        sink.setStoppedHandler(nullptr),               control.setConnectedHandler(nullptr),
-        control.setDisconnectedHandler(nullptr),
-    };
-    for (size_t i = 0; i < results.size(); ++i) EXPECT_EQ(results[i], -1) << "setter " << i;
-    EXPECT_TRUE(RemoteObject::signalHandlerVectorNoArgument.empty());
-    EXPECT_TRUE(RemoteObject::signalHandlerVectorObjectPath.empty());
-}
-
 }  // namespace
