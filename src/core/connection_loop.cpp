@@ -434,6 +434,11 @@ DBusMessage* ConnectionLoop::call(DBusMessage* message, int timeout, DBusError* 
     return reply;
 }
 
+size_t ConnectionLoop::queued() {
+    std::lock_guard<std::mutex> hold(lock_);
+    return work_.size();
+}
+
 void ConnectionLoop::stopAll() {
     gStop = 1;
     std::lock_guard<std::mutex> hold(gLoopsLock);

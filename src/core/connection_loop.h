@@ -52,6 +52,9 @@ public:
     void removeReceiver(RemoteObject* owner);  // its thread could not start
     void receive();
 
+    // Work waiting for a thread to run it.
+    size_t queued();
+
     // Every loop: the stop that ends receiving threads and drops later signals.
     static void stopAll();
     static bool stopped();
