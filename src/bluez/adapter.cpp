@@ -114,7 +114,8 @@ DeviceList::~DeviceList() {
 
 Adapter::Adapter(const char* path) : BluezObject(path, "org.bluez.Adapter") {}
 
-Adapter::~Adapter() {}
+// Before this class's part is gone: a handler may look at the whole object.
+Adapter::~Adapter() { releaseHandlers(); }
 
 Adapter* Adapter::getAdapter(const char* path) { return hasBluetoothd() ? new Adapter(path) : 0; }
 

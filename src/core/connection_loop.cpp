@@ -70,14 +70,19 @@ std::map<ConnectionLoop*, RemoteObject*> gOwners;
 std::multimap<const void*, ConnectionLoop*> gStarting;
 
 // The notify of a waited-for pending call: the waiting thread takes the reply.
+// The waiting thread and libdbus each hold a reference: the notify may run
+// after the wait has ended (a wait also asks the call whether it completed).
 struct Waiter {
-    ConnectionLoop* loop;
     std::mutex* lock;
     std::condition_variable* changed;
     bool done;
+    std::atomic<int> references;
 };
 
-void freeWaiter(void* data) { delete static_cast<Waiter*>(data); }
+void releaseWaiter(void* data) {
+    Waiter* waiter = static_cast<Waiter*>(data);
+    if (--waiter->references == 0) delete waiter;
+}
 
 int pollFor(DBusConnection* connection, int wakeFd, int milliseconds, bool& socketReady) {
     struct pollfd fds[2];
@@ -352,19 +357,33 @@ void ConnectionLoop::receive() {
 
 void ConnectionLoop::onCompleted(DBusPendingCall*, void* data) {
     Waiter* waiter = static_cast<Waiter*>(data);
-    std::lock_guard<std::mutex> hold(*waiter->lock);
-    waiter->done = true;
+    {
+        std::lock_guard<std::mutex> hold(*waiter->lock);
+        waiter->done = true;
+    }
     waiter->changed->notify_all();
+    // Orders this call before the waiter's release for ThreadSanitizer, which
+    // cannot see libdbus's own reference count.
+    waiter->references.fetch_add(0, std::memory_order_release);
 }
 
 ConnectionLoop::End ConnectionLoop::wait(DBusPendingCall* pending, int timeout, bool runMethodCalls,
                                          const std::atomic<int>* interrupted) {
     Waiter* waiter = new Waiter;
-    waiter->loop = this;
     waiter->lock = &lock_;
     waiter->changed = &changed_;
     waiter->done = false;
-    dbus_pending_call_set_notify(pending, &onCompleted, waiter, &freeWaiter);
+    waiter->references = 2;
+    if (!dbus_pending_call_set_notify(pending, &onCompleted, waiter, &releaseWaiter))
+        releaseWaiter(waiter);  // libdbus holds none
+    End end = waitFor(pending, waiter, timeout, runMethodCalls, interrupted);
+    releaseWaiter(waiter);
+    return end;
+}
+
+ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, const void* notified, int timeout,
+                                            bool runMethodCalls, const std::atomic<int>* interrupted) {
+    const Waiter* waiter = static_cast<const Waiter*>(notified);
     bool endless = timeout == DBUS_TIMEOUT_INFINITE;
     Clock::time_point deadline =
         Clock::now() + std::chrono::milliseconds(timeout < 0 ? kDefaultTimeoutMs : timeout);

@@ -84,6 +84,8 @@ private:
     void queue(const Work& work);
     void wake();
     bool mayPump(bool receiving, Clock::time_point now) const;
+    End waitFor(DBusPendingCall* pending, const void* waiter, int timeout, bool runMethodCalls,
+                const std::atomic<int>* interrupted);
 
     static DBusHandlerResult filter(DBusConnection*, DBusMessage* message, void* data);
     static void onDispatchStatus(DBusConnection*, DBusDispatchStatus status, void* data);

@@ -205,6 +205,10 @@ TEST_F(BlockingCalls, AreNotHeldUpByAHandlerOfAnotherBusWaitingOnTheirs) {
     if (systemLoop == nullptr) {
         systemLoop = new RemoteObject("org.freedesktop.DBus", "/", "org.freedesktop.DBus", DBUS_BUS_SYSTEM);
         ASSERT_EQ(systemLoop->startLoop(), 0);
+        std::atexit([] {
+            systemLoop->stopLoop();
+            systemLoop->waitLoop();
+        });
     }
     // A new name on the system bus makes the bus daemon signal it.
     DBusConnection* newcomer = dbus_bus_get_private(DBUS_BUS_SYSTEM, nullptr);
@@ -285,18 +289,20 @@ TEST(TheLoop, ServesAnAgentlessCallMadeBeforeItStartedAndDropsSignalsAfterItStop
         {
             Peer::ensureStarted();
             auto peer = peerObject();
-            // A call that waits for this process's own path, made before any loop runs.
-            LatePath late(peer->getConnection());
-            auto waiting = late.caller(DBUS_BUS_SESSION);
-            std::thread early([&] {
-                waiting->newMessage("Wait");
-                if (waiting->sendMessage(true, 5000) != 0) _exit(2);
-            });
-            std::this_thread::sleep_for(100ms);
             auto owner = peerObject();
-            if (owner->setSignalHandlerString("Tick", &count) != 0 || owner->startLoop() != 0) _exit(3);
-            late.answerAfter(100ms);
-            early.join();
+            {
+                // A call that waits for this process's own path, made before any loop runs.
+                LatePath late(peer->getConnection());
+                auto waiting = late.caller(DBUS_BUS_SESSION);
+                std::thread early([&] {
+                    waiting->newMessage("Wait");
+                    if (waiting->sendMessage(true, 5000) != 0) _exit(2);
+                });
+                std::this_thread::sleep_for(100ms);
+                if (owner->setSignalHandlerString("Tick", &count) != 0 || owner->startLoop() != 0) _exit(3);
+                late.answerAfter(100ms);
+                early.join();
+            }
             // The loop's object destroyed while its loop dispatches.
             callPeer(*peer, "StartTicking", 1u);
             std::this_thread::sleep_for(200ms);
