@@ -1,5 +1,6 @@
 #include <bluetooth/auto_connect.h>
 
+#include <atomic>
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
@@ -98,20 +99,20 @@ WriteResult writeAtomically(const std::string& path, const std::string& content,
     std::string::size_type slash = target.rfind('/');
     std::string prefix = target.substr(0, slash + 1) + "." + target.substr(slash + 1) + ".new-" +
                          std::to_string(static_cast<long>(getpid())) + "-";
-    static unsigned counter = 0;
+    static std::atomic<unsigned> counter(0);
     std::string temporary;
     int fd = -1;
     for (int attempt = 0; fd < 0 && attempt < 100; ++attempt) {
-        temporary = prefix + std::to_string(__sync_fetch_and_add(&counter, 1));
+        temporary = prefix + std::to_string(counter++);
         fd = open(temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0666);
         if (fd < 0 && errno != EEXIST) return kCannotCreate;
     }
     if (fd < 0) return kCannotCreate;
     if (replacing) {
         if (fchown(fd, old.st_uid, old.st_gid) != 0) {
-            // Not ours to give away: the file becomes this process's.
+            // Only root may keep another owner: the file becomes this process's.
         }
-        fchmod(fd, old.st_mode & 07777);
+        fchmod(fd, old.st_mode & 07777);  // best effort, like the owner
     }
     bool ok = writeAll(fd, content) && fsync(fd) == 0;
     ok = close(fd) == 0 && ok;
@@ -134,7 +135,8 @@ bool leadingNumber(const std::string& content, long& value) {
     return end != start;
 }
 
-// The flag read as a boolean: only 0 and 1 are one; anything else is false.
+// The flag read as a boolean, as a stream reads one: 1 is true; 0, any other
+// number and no number are false.
 bool enabledFlag(const std::string& content) {
     long value = 0;
     return leadingNumber(content, value) && value == 1;
