@@ -49,6 +49,12 @@ std::vector<ConnectionLoop*> gLoops;  // never freed: shared connections live as
 
 // The loop whose receiving thread this thread is; null on other threads.
 thread_local ConnectionLoop* tReceiving = 0;
+// Whether this thread is inside libdbus's dispatch (an object path of other
+// code than the Agent's is called there): a wait there could never end.
+thread_local bool tInDispatch = false;
+
+const char kInDispatchText[] =
+    "A reply cannot be waited for inside libdbus's dispatch (an object path's own handler)";
 
 // ---- uses that destruction waits for ----
 
@@ -214,9 +220,13 @@ DBusHandlerResult ConnectionLoop::defer(DBusMessage* message, DBusObjectPathMess
 }
 
 void ConnectionLoop::dispatchAll() {
+    tInDispatch = true;
     while (dbus_connection_dispatch(connection_) == DBUS_DISPATCH_DATA_REMAINS) {
     }
+    tInDispatch = false;
 }
+
+const char* ConnectionLoop::cannotWait() { return tInDispatch ? kInDispatchText : 0; }
 
 void ConnectionLoop::pump(int milliseconds) {
     if (dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_DATA_REMAINS) {
@@ -426,6 +436,10 @@ ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, const void
 }
 
 DBusMessage* ConnectionLoop::call(DBusMessage* message, int timeout, DBusError* error) {
+    if (const char* why = cannotWait()) {
+        dbus_set_error_const(error, DBUS_ERROR_FAILED, why);
+        return 0;
+    }
     DBusPendingCall* pending = 0;
     if (!dbus_connection_send_with_reply(connection_, message, &pending, timeout) || pending == 0) {
         dbus_set_error_const(error, DBUS_ERROR_DISCONNECTED, "Connection is closed");

@@ -41,6 +41,10 @@ public:
     End wait(DBusPendingCall* pending, int timeout, bool runMethodCalls,
              const std::atomic<int>* interrupted);
 
+    // Why this thread cannot wait for a reply now (it is inside libdbus's
+    // dispatch), or null.
+    static const char* cannotWait();
+
     // Queues a method call for a thread that may run callers' code; the Agent's
     // object path dispatches through this.
     DBusHandlerResult defer(DBusMessage* message, DBusObjectPathMessageFunction function,

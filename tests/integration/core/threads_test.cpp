@@ -233,6 +233,32 @@ TEST_F(BlockingCalls, ReportTheDBusErrorNameBesideItsText) {
     EXPECT_EQ(peer->getErrorName(), "");
 }
 
+std::string gInDispatchError;
+DBusHandlerResult callFromObjectPath(DBusConnection* connection, DBusMessage* message, void*) {
+    auto object = peerObject();
+    object->newMessage("Echo");
+    object->append("inside");
+    object->sendMessage(true, -1);
+    gInDispatchError = object->getErrorName();
+    DBusMessage* reply = dbus_message_new_method_return(message);
+    const char* text = "pong";
+    dbus_message_append_args(reply, DBUS_TYPE_STRING, &text, DBUS_TYPE_INVALID);
+    dbus_connection_send(connection, reply, nullptr);
+    dbus_message_unref(reply);
+    return DBUS_HANDLER_RESULT_HANDLED;
+}
+
+TEST_F(BlockingCalls, FailAtOnceInsideAnObjectPathOfTheirOwnConnection) {
+    DBusObjectPathVTable vtable{};
+    vtable.message_function = &callFromObjectPath;
+    DBusConnection* connection = peer->getConnection();
+    ASSERT_TRUE(dbus_connection_register_object_path(connection, "/org/btbus/Callback", &vtable, nullptr));
+    callPeer(*peer, "CallBack", peer->getConnectionName(), ObjectPath("/org/btbus/Callback"));
+    dbus_connection_unregister_object_path(connection, "/org/btbus/Callback");
+    // At once, not libdbus's time-out: the wait would never end there.
+    EXPECT_EQ(gInDispatchError, "org.freedesktop.DBus.Error.Failed");
+}
+
 TEST_F(ThreadTest, SignalDecodingErrorsNeverChangeAnOperationRunningOnTheLoopsObject) {
     ASSERT_EQ(peer->setSignalHandlerStringVariant("PropertyChanged",
                                                   [](RemoteObject*, const char*, const Variant*) {}),
