@@ -78,15 +78,19 @@ std::multimap<const void*, ConnectionLoop*> gStarting;
 // The notify of a waited-for pending call: the waiting thread takes the reply.
 // The waiting thread and libdbus each hold a reference: the notify may run
 // after the wait has ended (a wait also asks the call whether it completed).
-struct Waiter {
+}  // namespace
+
+struct ConnectionLoop::Waiter {
     std::mutex* lock;
     std::condition_variable* changed;
     bool done;
     std::atomic<int> references;
 };
 
+namespace {
+
 void releaseWaiter(void* data) {
-    Waiter* waiter = static_cast<Waiter*>(data);
+    ConnectionLoop::Waiter* waiter = static_cast<ConnectionLoop::Waiter*>(data);
     if (--waiter->references == 0) delete waiter;
 }
 
@@ -391,9 +395,8 @@ ConnectionLoop::End ConnectionLoop::wait(DBusPendingCall* pending, int timeout, 
     return end;
 }
 
-ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, const void* notified, int timeout,
+ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, const Waiter* waiter, int timeout,
                                             bool runMethodCalls, const std::atomic<int>* interrupted) {
-    const Waiter* waiter = static_cast<const Waiter*>(notified);
     bool endless = timeout == DBUS_TIMEOUT_INFINITE;
     Clock::time_point deadline =
         Clock::now() + std::chrono::milliseconds(timeout < 0 ? kDefaultTimeoutMs : timeout);
@@ -407,6 +410,7 @@ ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, const void
         bool completed = dbus_pending_call_get_completed(pending);
         hold.lock();
         if (completed) return kReplied;
+        if (!dbus_connection_get_is_connected(connection_)) return kClosed;
         if (interrupted != 0 && interrupted->load() != 0) return kInterrupted;
         Clock::time_point now = Clock::now();
         if (!endless && now >= deadline) return kTimedOut;

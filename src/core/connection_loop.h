@@ -31,6 +31,8 @@ public:
     static ConnectionLoop* of(DBusConnection* connection);
 
     enum End { kReplied, kTimedOut, kInterrupted, kClosed };
+    // What the notify of a waited-for call shares with the waiting thread.
+    struct Waiter;
 
     // Sends message and waits for its reply; a D-Bus error, a time-out or a
     // closed connection gives null with error set. timeout as libdbus takes it.
@@ -88,7 +90,7 @@ private:
     void queue(const Work& work);
     void wake();
     bool mayPump(bool receiving, Clock::time_point now) const;
-    End waitFor(DBusPendingCall* pending, const void* waiter, int timeout, bool runMethodCalls,
+    End waitFor(DBusPendingCall* pending, const Waiter* waiter, int timeout, bool runMethodCalls,
                 const std::atomic<int>* interrupted);
 
     static DBusHandlerResult filter(DBusConnection*, DBusMessage* message, void* data);
