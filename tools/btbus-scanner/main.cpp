@@ -1,0 +1,46 @@
+// btbus-scanner: hosts the scanner service on the session bus.
+#include <cstdio>
+#include <cstring>
+
+#include <glib-unix.h>
+
+#include <bluetooth/scanner_server.h>
+
+namespace {
+
+const char kUsage[] =
+    "Usage: btbus-scanner [ADAPTER...]\n"
+    "Serves com.quillmar.bluetooth on the session bus: other programs ask it which\n"
+    "Bluetooth devices are around (com.quillmar.bluetooth.Scanner.ListDevices) and\n"
+    "stop the discovery they started (RemoveFinder). Each ADAPTER (a name such as\n"
+    "hci0, or an address) starts discovery at once.\n"
+    "It exits with status 0 thirty seconds after the last discovery was started,\n"
+    "or on SIGTERM or SIGINT; the bus starts it again on the next call.\n";
+
+gboolean quit(gpointer server) {
+    static_cast<Bluetooth::ScannerServer*>(server)->quitLoop();
+    return G_SOURCE_CONTINUE;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    for (int i = 1; i < argc; ++i) {
+        if (std::strcmp(argv[i], "--help") == 0 || std::strcmp(argv[i], "-h") == 0) {
+            std::fputs(kUsage, stdout);
+            return 0;
+        }
+        if (argv[i][0] == '-') {
+            std::fprintf(stderr, "btbus-scanner: unknown option %s\n%s", argv[i], kUsage);
+            return 2;
+        }
+    }
+    Bluetooth::ScannerServer server;
+    for (int i = 1; i < argc; ++i) server.addAdapterFounder(argv[i]);
+    guint term = g_unix_signal_add(SIGTERM, &quit, &server);
+    guint interrupt = g_unix_signal_add(SIGINT, &quit, &server);
+    server.startLoop();
+    g_source_remove(term);
+    g_source_remove(interrupt);
+    return 0;
+}
