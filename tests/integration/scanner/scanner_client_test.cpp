@@ -34,17 +34,12 @@ bool scannerRuns() { return nameHasOwner(DBUS_BUS_SESSION, kScannerName); }
 
 // Ends the daemon that the bus started for this test, if one runs.
 void stopActivatedDaemon() {
-    DBusConnection* bus = dbus_bus_get_private(DBUS_BUS_SESSION, nullptr);
-    ASSERT_NE(bus, nullptr);
-    Bluetooth::internal::MessagePtr call(dbus_message_new_method_call(
-        "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus", "GetConnectionUnixProcessID"));
-    const char* name = kScannerName;
-    dbus_message_append_args(call.get(), DBUS_TYPE_STRING, &name, DBUS_TYPE_INVALID);
-    Bluetooth::internal::MessagePtr reply(dbus_connection_send_with_reply_and_block(bus, call.get(), -1, nullptr));
+    Bluetooth::internal::ScopedError error;
+    Bluetooth::internal::MessagePtr reply = callOnSession("org.freedesktop.DBus", "/org/freedesktop/DBus",
+                                                          "org.freedesktop.DBus", "GetConnectionUnixProcessID",
+                                                          kScannerName, error);
     dbus_uint32_t pid = 0;
     if (reply) dbus_message_get_args(reply.get(), nullptr, DBUS_TYPE_UINT32, &pid, DBUS_TYPE_INVALID);
-    dbus_connection_close(bus);
-    dbus_connection_unref(bus);
     if (pid > 0) kill(static_cast<pid_t>(pid), SIGTERM);
     EXPECT_TRUE(waitUntil([] { return !scannerRuns(); }));
 }

@@ -40,29 +40,35 @@ private:
     pid_t pid_ = -1;
 };
 
-// One call on a private connection, so that the library's shared one is not
-// involved: the a{ss} answer in full (the empty key included) or the error.
+// A call with one string argument on a private session connection, so that
+// the library's shared one is not involved; null on failure (error set).
+inline Bluetooth::internal::MessagePtr callOnSession(const char* destination, const char* path,
+                                                     const char* interface, const char* method,
+                                                     const std::string& argument,
+                                                     Bluetooth::internal::ScopedError& error) {
+    DBusConnection* connection = dbus_bus_get_private(DBUS_BUS_SESSION, error.get());
+    if (connection == nullptr) return nullptr;
+    dbus_connection_set_exit_on_disconnect(connection, FALSE);
+    Bluetooth::internal::MessagePtr call(dbus_message_new_method_call(destination, path, interface, method));
+    const char* text = argument.c_str();
+    dbus_message_append_args(call.get(), DBUS_TYPE_STRING, &text, DBUS_TYPE_INVALID);
+    Bluetooth::internal::MessagePtr reply(
+        dbus_connection_send_with_reply_and_block(connection, call.get(), -1, error.get()));
+    dbus_connection_close(connection);
+    dbus_connection_unref(connection);
+    return reply;
+}
+
+// The scanner's a{ss} answer in full (the empty key included) or its error.
 struct Answer {
     std::map<std::string, std::string> devices;
     std::string errorName, error;
 };
 
 inline Answer callScanner(const char* method, const std::string& argument) {
-    Answer answer;
     Bluetooth::internal::ScopedError error;
-    DBusConnection* connection = dbus_bus_get_private(DBUS_BUS_SESSION, error.get());
-    if (connection == nullptr) {
-        answer.error = error.text();
-        return answer;
-    }
-    dbus_connection_set_exit_on_disconnect(connection, FALSE);
-    Bluetooth::internal::MessagePtr call(dbus_message_new_method_call(kScannerName, "/", kScannerInterface, method));
-    const char* text = argument.c_str();
-    dbus_message_append_args(call.get(), DBUS_TYPE_STRING, &text, DBUS_TYPE_INVALID);
-    Bluetooth::internal::MessagePtr reply(
-        dbus_connection_send_with_reply_and_block(connection, call.get(), -1, error.get()));
-    answer.errorName = error.name();
-    answer.error = error.text();
+    Bluetooth::internal::MessagePtr reply = callOnSession(kScannerName, "/", kScannerInterface, method, argument, error);
+    Answer answer{ {}, error.name(), error.text() };
     DBusMessageIter args, array, entry;
     if (reply && dbus_message_iter_init(reply.get(), &args) &&
         dbus_message_iter_get_arg_type(&args) == DBUS_TYPE_ARRAY) {
@@ -76,8 +82,6 @@ inline Answer callScanner(const char* method, const std::string& argument) {
             answer.devices[key] = value;
         }
     }
-    dbus_connection_close(connection);
-    dbus_connection_unref(connection);
     return answer;
 }
 

@@ -148,21 +148,14 @@ TEST_F(AScannerDaemon, AnswersGdbusBusctlAndDbusSend) {
     EXPECT_NE(introspection.find("RemoveFinder(in  s arg0);"), std::string::npos) << introspection;
 }
 
-// DeviceFound with address and {"Address": address}, sent raw on the system bus.
+// DeviceFound with address and no properties, sent raw on the system bus.
 void emitFound(DBusConnection* connection, const std::string& path, const std::string& address) {
     Bluetooth::internal::MessagePtr signal(dbus_message_new_signal(path.c_str(), "org.bluez.Adapter", "DeviceFound"));
-    DBusMessageIter args, dict, entry, variant;
+    DBusMessageIter args, dict;
     const char* text = address.c_str();
-    const char* key = "Address";
     dbus_message_iter_init_append(signal.get(), &args);
     dbus_message_iter_append_basic(&args, DBUS_TYPE_STRING, &text);
     dbus_message_iter_open_container(&args, DBUS_TYPE_ARRAY, "{sv}", &dict);
-    dbus_message_iter_open_container(&dict, DBUS_TYPE_DICT_ENTRY, nullptr, &entry);
-    dbus_message_iter_append_basic(&entry, DBUS_TYPE_STRING, &key);
-    dbus_message_iter_open_container(&entry, DBUS_TYPE_VARIANT, "s", &variant);
-    dbus_message_iter_append_basic(&variant, DBUS_TYPE_STRING, &text);
-    dbus_message_iter_close_container(&entry, &variant);
-    dbus_message_iter_close_container(&dict, &entry);
     dbus_message_iter_close_container(&args, &dict);
     dbus_connection_send(connection, signal.get(), nullptr);
 }
