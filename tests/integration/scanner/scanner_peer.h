@@ -30,7 +30,7 @@ public:
     ~Daemon() { stop(); }
     int stop() {
         if (pid_ <= 0) return -1;
-        int status = btbus_test::stop(pid_);
+        int status = btbus_test::stop(pid_, SIGTERM, 10000ms);
         pid_ = -1;
         waitUntil([] { return !nameHasOwner(DBUS_BUS_SESSION, kScannerName); });
         return status;
