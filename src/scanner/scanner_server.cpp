@@ -172,15 +172,13 @@ struct ScannerServer::Service {
         AddressSet* dropped = 0;
         {
             Hold hold(server->stateLock);
-            if (server->founders != 0) {
-                for (AdapterList::iterator it = server->founders->begin();
-                     it != server->founders->end(); ++it) {
-                    if (*it == 0 || strcmp((*it)->getPath(), adapter->getPath()) != 0) continue;
-                    server->retired.push_back(*it);
-                    server->founders->erase(it);
-                    stop = true;
-                    break;
-                }
+            AdapterList& founders = *server->founders;
+            for (AdapterList::iterator it = founders.begin(); it != founders.end(); ++it) {
+                if (*it == 0 || strcmp((*it)->getPath(), adapter->getPath()) != 0) continue;
+                server->retired.push_back(*it);
+                founders.erase(it);
+                stop = true;
+                break;
             }
             FinderTable::iterator found = object->finders->find(adapterNameFromPath(adapter->getPath()));
             if (found != object->finders->end()) {
