@@ -7,6 +7,7 @@
 #include <bluetooth/util.h>
 
 #include "core/log.h"
+#include "scanner/guarded.h"
 
 BT_LOG_FILE("scanner_server.cpp");
 
@@ -94,6 +95,16 @@ struct ScannerServer::Service {
     // The DeviceFound and DeviceDisappeared callbacks, on the receiving thread.
     static void scannerDeviceFound(RemoteObject* object, const char* address,
                                    const Dict* properties) {
+        internal::guarded(kLogFile, __LINE__, "DeviceFound",
+                          [&] { deviceFound(object, address, properties); });
+    }
+
+    static void scannerDeviceDisappeared(RemoteObject* object, const char* address) {
+        internal::guarded(kLogFile, __LINE__, "DeviceDisappeared",
+                          [&] { deviceDisappeared(object, address); });
+    }
+
+    static void deviceFound(RemoteObject* object, const char* address, const Dict* properties) {
         std::string name;
         ScannerServer* server = finderFor(object, name);
         // An empty address is no device, and an empty key would end a client's
@@ -107,7 +118,7 @@ struct ScannerServer::Service {
         if (set != 0) set->insert(address);
     }
 
-    static void scannerDeviceDisappeared(RemoteObject* object, const char* address) {
+    static void deviceDisappeared(RemoteObject* object, const char* address) {
         std::string name;
         ScannerServer* server = finderFor(object, name);
         if (server == 0 || address == 0) return;
@@ -192,13 +203,28 @@ struct ScannerServer::Service {
     }
 };
 
+namespace {
+
+// The bindings' call of a method: an exception becomes a failure with its text.
+template <typename Method>
+gboolean answer(const char* what, GError** error, Method method) {
+    gboolean result = FALSE;
+    bool done = internal::guarded(kLogFile, __LINE__, what, [&] { result = method(); });
+    if (!done && (error == 0 || *error == 0)) fail(error, "%s failed", what);
+    return result;
+}
+
+}  // namespace
+
 gboolean scanner_object_list_devices(ScannerObject* object, const char* arg0, GHashTable** arg1,
                                      GError** error) {
-    return ScannerServer::Service::listDevices(object, arg0, arg1, error);
+    return answer("ListDevices", error,
+                  [&] { return ScannerServer::Service::listDevices(object, arg0, arg1, error); });
 }
 
 gboolean scanner_object_remove_finder(ScannerObject* object, const char* arg0, GError** error) {
-    return ScannerServer::Service::removeFinder(object, arg0, error);
+    return answer("RemoveFinder", error,
+                  [&] { return ScannerServer::Service::removeFinder(object, arg0, error); });
 }
 
 }  // namespace Bluetooth

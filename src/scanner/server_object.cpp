@@ -8,6 +8,7 @@
 #include <bluetooth/scanner_server.h>
 
 #include "core/log.h"
+#include "scanner/guarded.h"
 
 BT_LOG_FILE("server_object.cpp");
 
@@ -143,8 +144,10 @@ const char* ServerObject::getInterface() const {
 }
 
 gboolean updateTimer(void* data) {
-    ServerObject* object = static_cast<ServerObject*>(data);
-    return object->callbackThreadHandler(data) ? TRUE : FALSE;
+    bool keep = true;  // a hook that throws keeps its timer
+    internal::guarded(kLogFile, __LINE__, "Timer tick",
+                      [&] { keep = static_cast<ServerObject*>(data)->callbackThreadHandler(data); });
+    return keep ? TRUE : FALSE;
 }
 
 }  // namespace Bluetooth
