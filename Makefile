@@ -38,9 +38,9 @@ sanitize: deps
 # instrumented: tests/tsan.supp names what of it TSan cannot see through.
 tsan: deps
 	cmake -S . -B $(BUILD)-tsan -DCMAKE_BUILD_TYPE=Debug -DBTBUS_TSAN=ON -DBTBUS_BUILD_BENCHMARKS=OFF
-	cmake --build $(BUILD)-tsan -j $(JOBS) --target btbus_core_tests btbus_bluez_tests
+	cmake --build $(BUILD)-tsan -j $(JOBS) --target btbus_core_tests btbus_bluez_tests btbus_scanner_tests btbus-scanner
 	cd $(BUILD)-tsan && TSAN_OPTIONS="suppressions=$(CURDIR)/tests/tsan.supp halt_on_error=1 second_deadlock_stack=1" \
-	  ctest --output-on-failure -j 2 -R "btbus_(core|bluez)_tests"
+	  ctest --output-on-failure -j 2 -R "btbus_(core|bluez|scanner)_tests"
 
 clean:
 	rm -rf $(BUILD) $(BUILD)-sanitize $(BUILD)-tsan
