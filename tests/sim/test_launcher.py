@@ -33,6 +33,9 @@ class LauncherTest(unittest.TestCase):
 
     def test_sigterm_stops_everything_it_started(self):
         launcher = Launcher()
+        sourced = subprocess.run(['sh', '-c', '. "$1" && echo "$DBUS_SYSTEM_BUS_ADDRESS"', 'sh', launcher.env_file],
+                                 capture_output=True, text=True, timeout=10, check=True)
+        self.assertEqual(sourced.stdout.strip(), launcher.env['DBUS_SYSTEM_BUS_ADDRESS'])
         children = children_of(launcher.proc.pid)
         self.assertEqual(sorted(os.path.basename(command_of(pid)) for pid in children),
                          ['dbus-daemon', 'dbus-daemon', 'python3'])
