@@ -1,12 +1,12 @@
-// watch: every signal of the adapter, its devices and their audio profiles.
+// watch: every signal of bluetoothd's adapters, devices and audio profiles.
 //
-// The library calls each handler once per proxy registered for the signal's
-// interface and member, with the proxy rather than the sender. So a filter,
-// added to the system bus before the library's own (libdbus runs filters in
-// the order they were added), notes the sender of the signal being
-// dispatched, and the first handler call for that signal reports it.
-#include <vector>
-
+// The library hands a handler the proxy that registered it, not the sender,
+// and calls it for a signal of the proxy's interface from any path the bus
+// delivers. So one proxy per interface registers the handlers, one match rule
+// makes the bus deliver every signal of org.bluez, and a filter added before
+// the library's own (libdbus runs filters in the order they were added) notes
+// the sender of the signal being dispatched. Devices that appear later need
+// no new registration.
 #include "commands.h"
 
 using namespace Bluetooth;
@@ -20,9 +20,6 @@ struct Watch {
     // The signal being dispatched; only the dispatching thread touches these.
     std::string path, interface, member;
     bool reported = true;
-    // Devices created meanwhile, for the main thread to watch too.
-    std::mutex lock;
-    std::vector<std::string> created;
 };
 Watch gWatch;
 
@@ -70,10 +67,6 @@ void onPath(RemoteObject*, const ObjectPath* path) {
     if (!e) return;
     (*e)["object"] = path->str();
     report(*e, (*e)["event"].get<std::string>() + " " + shortName(path->str()));
-    if ((*e)["event"] == "DeviceCreated") {
-        std::lock_guard<std::mutex> hold(gWatch.lock);
-        gWatch.created.push_back(path->str());
-    }
 }
 
 void onSignal(RemoteObject*) {
@@ -81,27 +74,7 @@ void onSignal(RemoteObject*) {
     if (e) report(*e, (*e)["event"]);
 }
 
-// The proxies of one device whose signals are watched.
-void watchDevice(const std::string& path, std::vector<std::unique_ptr<BluezObject> >& proxies) {
-    std::unique_ptr<Device> device(Device::getDevice(path.c_str()));
-    std::unique_ptr<Audio> all(Audio::getAudio(path.c_str()));
-    std::unique_ptr<AudioSink> sink(AudioSink::getAudioSink(path.c_str()));
-    std::unique_ptr<Control> control(Control::getControl(path.c_str()));
-    if (!device || !all || !sink || !control) return;  // bluetoothd left
-    device->setDisconnectRequestedHandler(&onSignal);
-    sink->setConnectedHandler(&onSignal);
-    sink->setDisconnectedHandler(&onSignal);
-    sink->setPlayingHandler(&onSignal);
-    sink->setStoppedHandler(&onSignal);
-    control->setConnectedHandler(&onSignal);
-    control->setDisconnectedHandler(&onSignal);
-    proxies.emplace_back(device.release());
-    proxies.emplace_back(all.release());
-    proxies.emplace_back(sink.release());
-    proxies.emplace_back(control.release());
-    for (size_t i = proxies.size() - 4; i < proxies.size(); ++i)
-        proxies[i]->setPropertyChangedHandler(&onProperty);
-}
+const char kEveryBluezSignal[] = "type='signal',sender='org.bluez'";
 
 }  // namespace
 
@@ -112,33 +85,41 @@ int watch(const Options& options) {
     DBusConnection* bus = Connection::get(DBUS_BUS_SYSTEM);
     if (bus == 0 || !dbus_connection_add_filter(bus, &noteSender, 0, 0))
         throw Failure("cannot watch the system bus");
+    dbus_bus_add_match(bus, kEveryBluezSignal, 0);
 
     Output out(options);
     gWatch.out = &out;
     bluez->setAdapterAddedHandler(&onPath);
     bluez->setAdapterRemovedHandler(&onPath);
     bluez->setDefaultAdapterChangedHandler(&onPath);
-    chosen->setPropertyChangedHandler(&onProperty);
     chosen->setDeviceCreatedHandler(&onPath);
     chosen->setDeviceRemovedHandler(&onPath);
-    std::vector<std::unique_ptr<BluezObject> > proxies;
-    std::unique_ptr<DeviceList> devices(chosen->listDevices());
-    for (size_t i = 0; devices && i < devices->size(); ++i)
-        if ((*devices)[i]) watchDevice((*devices)[i]->getPath(), proxies);
+    // Any path serves: the handlers are reached by interface and member.
+    const char* anyPath = chosen->getPath();
+    std::unique_ptr<Device> device(Device::getDevice(anyPath));
+    std::unique_ptr<Audio> all(Audio::getAudio(anyPath));
+    std::unique_ptr<AudioSink> sink(AudioSink::getAudioSink(anyPath));
+    std::unique_ptr<Control> control(Control::getControl(anyPath));
+    if (!device || !all || !sink || !control) throw Failure("bluetoothd left the system bus");
+    device->setDisconnectRequestedHandler(&onSignal);
+    sink->setConnectedHandler(&onSignal);
+    sink->setDisconnectedHandler(&onSignal);
+    sink->setPlayingHandler(&onSignal);
+    sink->setStoppedHandler(&onSignal);
+    control->setConnectedHandler(&onSignal);
+    control->setDisconnectedHandler(&onSignal);
+    for (BluezObject* proxy : std::initializer_list<BluezObject*>{bluez.get(), chosen.get(), device.get(),
+                                                                   all.get(), sink.get(), control.get()})
+        proxy->setPropertyChangedHandler(&onProperty);
     chosen->startLoop();
-    if (!options.json)
-        out.print("watching " + shortName(chosen->getPath()) + " and its devices (Ctrl-C stops)");
-
-    while (!waitForStop(std::chrono::milliseconds(200))) {
-        std::vector<std::string> created;
-        {
-            std::lock_guard<std::mutex> hold(gWatch.lock);
-            created.swap(gWatch.created);
-        }
-        for (const std::string& path : created) watchDevice(path, proxies);
-    }
+    if (options.json)
+        out.print(json{{"event", "watching"}, {"path", chosen->getPath()}});
+    else
+        out.print("watching bluetoothd's adapters and devices (Ctrl-C stops)");
+    waitForStop(std::chrono::milliseconds(0));
     chosen->stopLoop();
     chosen->waitLoop();
+    dbus_bus_remove_match(bus, kEveryBluezSignal, 0);
     dbus_connection_remove_filter(bus, &noteSender, 0);
     Connection::unref(bus);
     gWatch.out = 0;
