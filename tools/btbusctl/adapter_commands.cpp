@@ -202,7 +202,7 @@ int scan(const Options& options, int seconds) {
     }
     out.progress("");
     chosen->stopDiscovery();
-    properties(*chosen);  // a blocking call after it: the stop has reached bluetoothd
+    settle(*chosen);
     chosen->stopLoop();
     chosen->waitLoop();
     gScan.out = 0;

@@ -125,9 +125,7 @@ int standingAgent(const Options& options, const AgentOptions& settings) {
     ServedAgent agent(settings);
     chosen->startLoop();  // its thread dispatches the bus, so it serves the agent
     if (chosen->registerAgent(*agent) != 0) throw failed("RegisterAgent", *chosen);
-    // RegisterAgent is sent without waiting; bluetoothd handles one client's
-    // calls in order, so once this answers it has handled the registration.
-    properties(*chosen);
+    properties(*chosen);  // RegisterAgent was sent without waiting: now it has arrived
     std::string adapterName = shortName(chosen->getPath());
     if (options.json)
         out.print(json{{"event", "registered"}, {"path", agent->getPath()}, {"adapter", adapterName},
@@ -137,7 +135,7 @@ int standingAgent(const Options& options, const AgentOptions& settings) {
                   ") offered to " + adapterName + "; answering until interrupted");
     waitForStop(std::chrono::milliseconds(0));
     chosen->unregisterAgent(*agent);
-    properties(*chosen);  // let the unregistration reach bluetoothd before we go
+    settle(*chosen);
     chosen->stopLoop();
     chosen->waitLoop();
     if (!options.json) out.print("agent unregistered");

@@ -125,6 +125,8 @@ Dict properties(BluezObject& object) {
     return *dict;
 }
 
+void settle(BluezObject& object) { delete object.BluezObject::getProperties(); }
+
 Dict adapterProperties(Adapter& adapter) {
     std::unique_ptr<Dict> dict(adapter.getProperties());
     if (!dict) throw failed("GetProperties", adapter);

@@ -80,6 +80,10 @@ std::unique_ptr<Bluetooth::Device> knownDevice(Bluetooth::Adapter& adapter,
 // The properties of a proxy (BluezObject's own: no hciconfig run), or a Failure.
 Bluetooth::Dict properties(Bluetooth::BluezObject& object);
 Bluetooth::Dict adapterProperties(Bluetooth::Adapter& adapter);  // with HCIVersion
+// A blocking call after one-way requests: once it returns, bluetoothd (which
+// handles one client's calls in order) has handled them. Failure is ignored:
+// used on the way out, when bluetoothd may be gone already.
+void settle(Bluetooth::BluezObject& object);
 // A property's value, or an empty Variant-less default.
 const Bluetooth::Variant* lookup(const Bluetooth::Dict& dict, const std::string& name);
 
