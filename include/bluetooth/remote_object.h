@@ -2,6 +2,7 @@
 #define BTBUS_BLUETOOTH_REMOTE_OBJECT_H
 
 #include <list>
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -14,6 +15,9 @@
 namespace Bluetooth {
 
 class RemoteObject;
+namespace internal {
+class OperationScope;
+}
 
 // One registered signal handler: the proxy that registered it (not owned), the
 // signal's member name and the function to call.
@@ -46,8 +50,27 @@ typedef void (*SignalFunctionStringDict)(RemoteObject* object, const char* name,
 //   4 "Invalid reply value", 5 "Invalid reply format", 6 "Failed to create message",
 //   7 "Failed to append args to message", 8 "Failed to append args = iterator",
 //   9 "Failed to open container", 10 "Failed to send message",
-//   11 the D-Bus error's own message.
-// Not safe for concurrent use; operations return 0 on success and -1 on failure.
+//   11 the D-Bus error's own message (its name: getErrorName()).
+// Operations return 0 on success and -1 on failure.
+//
+// Threads. One object is used by one thread at a time; different objects may be
+// used from any threads at once. Each bus connection has one loop:
+// - startLoop() starts a receiving thread for the object's connection. Signal
+//   handlers, and the requests the process's Agent answers, run on a receiving
+//   thread, one at a time, outside libdbus's own locks.
+// - Blocking calls from any thread, a handler included, wait without holding the
+//   connection: while a receiving thread is free it reads their replies; while it
+//   is busy in a handler, a waiting thread reads them itself. sendMessagePending
+//   also answers the Agent's requests meanwhile, so pairing works from any thread.
+// - A handler may make calls, register handlers, and create or destroy proxies,
+//   its own included. Destroying a proxy removes its handlers and waits for a
+//   handler of it that runs on another thread to return. Destroying the object a
+//   loop was started on leaves the loop running without it.
+// - Signals that fail to decode set the error number of the object the loop was
+//   started on, unless an operation of it runs at that moment: start the loop on
+//   an object of its own to keep the two apart.
+// - Object paths registered on the connection by other code than the Agent are
+//   called from whichever thread reads the connection: keep them quick.
 class RemoteObject {
 public:
     // None of the texts may be null. Takes one reference on the shared connection
@@ -126,6 +149,9 @@ public:
     bool hasError() const;
     int getErrorNumber() const;
     std::string getErrorMessage();
+    // The D-Bus error name behind error 11 (for example
+    // "org.bluez.Error.AlreadyExists"); "" when there is none.
+    std::string getErrorName() const;
 
     // Register a handler for signalName of this object's interface: adds the
     // match rule type='signal',interface='I',member='M',path='P' to the bus and
@@ -147,8 +173,9 @@ public:
     // the connection survive a lost bus instead of exiting the process, and
     // takes over the connection's dispatch-status notification.
     int startLoop();
-    // Ends every receiving thread in the process, within one message or 100 ms;
-    // threads started afterwards end at once.
+    // Ends every receiving thread in the process at once (a thread in a handler
+    // ends when the handler returns); threads started afterwards end at once.
+    // Signals that arrive afterwards are dropped.
     void stopLoop();
     // Joins the thread started by startLoop.
     int waitLoop();
@@ -181,17 +208,25 @@ protected:
     int errorNumber;
     std::string errorMessage;
 
-    // Sets the error number (and, for 11, the text) and returns -1.
-    int fail(int number, const char* text = 0);
+    // Sets the error number (and, for 11, the text and name) and returns -1.
+    int fail(int number, const char* text = 0, const char* name = 0);
+    // Removes this object's handlers and their match rules, then waits for its
+    // handlers that run on other threads. Idempotent; a class whose handlers
+    // look at more than the RemoteObject calls it first in its destructor.
+    void releaseHandlers();
 
 private:
+    friend class internal::OperationScope;
+
     RemoteObject(const RemoteObject&) = delete;
     RemoteObject& operator=(const RemoteObject&) = delete;
 
     template <typename F>
     int addSignalHandler(std::list<SignalHandler<F> >& list, const char* signalName, F function);
     template <typename F>
-    void removeSignalHandlers(std::list<SignalHandler<F> >& list);
+    void removeSignalHandlers(std::list<SignalHandler<F> >& list, std::vector<std::string>& rules);
+    // Records a signal's decoding error unless an operation runs on this object.
+    void noteSignalError(int number);
     std::string matchRule(const std::string& signalName) const;
     void releaseReply();
     void releaseMessage();
@@ -201,12 +236,11 @@ private:
     // Why nothing can be sent now (no connection, no message), or null.
     const char* cannotSend() const;
     int readStringArray(std::vector<std::string>& values);
-    // Appends the entries of a dictionary array to dict, up to an entry with an
-    // empty name; says which part of an entry could not be decoded.
-    enum { kEntriesDecoded, kBadEntryName, kBadEntryValue };
-    int decodeEntries(DBusMessageIter& array, Dict& dict);
 
-    friend void* receiveSignal(void* object);
+    std::string errorName;
+    mutable std::mutex errorLock;  // the error state: signals may write it from a receiving thread
+    int operationDepth;            // proxy operations running on this object
+    bool handlersReleased;
 };
 
 // The receiving thread's function; object is the RemoteObject that started it.

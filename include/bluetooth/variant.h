@@ -9,20 +9,53 @@
 
 namespace Bluetooth {
 
-// A decoded D-Bus value. The order of the alternatives is part of the interface:
-// which() selects the signature written back (see RemoteObject::append) and the
-// text form (see util.h).
-//   0 UINT32, 1 UINT16, 2 BOOLEAN, 3 STRING or OBJECT_PATH (as text),
-//   4 array of strings or object paths, 5 INT16 (sign-extended).
-// Beware: Variant(someCharPointer) selects bool, as boost::variant picks the best
-// standard conversion; write Variant(std::string(text)) for a string.
 typedef boost::variant<unsigned int,
                        unsigned short,
                        bool,
                        std::string,
                        std::vector<std::string>,
                        int>
-    Variant;
+    VariantBase;
+
+// A decoded D-Bus value. The order of the alternatives is part of the interface:
+// which() selects the signature written back (see RemoteObject::append) and the
+// text form (see util.h).
+//   0 UINT32, 1 UINT16, 2 BOOLEAN, 3 STRING or OBJECT_PATH (as text),
+//   4 array of strings or object paths, 5 INT16 (sign-extended).
+// It is the boost::variant above in all but one respect: text given as a
+// character pointer is held as a string (the template alone would make it a bool).
+class Variant : public VariantBase {
+public:
+    Variant() : VariantBase() {}
+    Variant(const VariantBase& other) : VariantBase(other) {}
+    Variant(unsigned int value) : VariantBase(value) {}
+    Variant(unsigned short value) : VariantBase(value) {}
+    Variant(bool value) : VariantBase(value) {}
+    Variant(const std::string& value) : VariantBase(value) {}
+    Variant(std::string&& value) : VariantBase(std::move(value)) {}
+    Variant(const char* text) : VariantBase(std::string(text != 0 ? text : "")) {}
+    Variant(const std::vector<std::string>& value) : VariantBase(value) {}
+    Variant(std::vector<std::string>&& value) : VariantBase(std::move(value)) {}
+    Variant(int value) : VariantBase(value) {}
+
+    Variant& operator=(const char* text) {
+        VariantBase::operator=(std::string(text != 0 ? text : ""));
+        return *this;
+    }
+    template <typename T>
+    Variant& operator=(T&& value) {
+        Variant converted(std::forward<T>(value));
+        VariantBase::operator=(std::move(static_cast<VariantBase&>(converted)));
+        return *this;
+    }
+
+    bool operator==(const Variant& other) const { return base() == other.base(); }
+    bool operator!=(const Variant& other) const { return !(base() == other.base()); }
+    bool operator<(const Variant& other) const { return base() < other.base(); }
+
+private:
+    const VariantBase& base() const { return *this; }
+};
 
 // One property: its name and value.
 typedef std::pair<std::string, Variant> Entry;

@@ -8,6 +8,7 @@
 
 #include <bluetooth/connection.h>
 
+#include "core/connection_loop.h"
 #include "core/dbus_holders.h"
 #include "core/log.h"
 
@@ -166,7 +167,18 @@ Agent::Agent()
     }
 }
 
-Agent::~Agent() { std::free(vtable); }
+Agent::~Agent() {
+    // Owners are meant to unregister first; one that forgot costs nothing.
+    void* owner = 0;
+    DBusConnection* connection = path.empty() ? 0 : Connection::get(DBUS_BUS_SYSTEM);
+    if (connection != 0) {
+        if (dbus_connection_get_object_path_data(connection, path.c_str(), &owner) && owner == this)
+            dbus_connection_unregister_object_path(connection, path.c_str());
+        Connection::unref(connection);
+    }
+    internal::ConnectionLoop::forgetMethodCalls(this);
+    std::free(vtable);
+}
 
 int Agent::registerPath() {
     std::ostringstream built;
@@ -177,8 +189,22 @@ int Agent::registerPath() {
     if (connection != 0) {
         internal::ScopedError error;
         // The quiet form: an already registered path is reported here, not on stderr.
+        // Requests reach the handler table through the connection's loop, which
+        // runs them outside libdbus's dispatch, on a thread that may wait (the
+        // delay) without holding up anyone's replies.
+        static const DBusObjectPathVTable kDeferred = {
+            0,
+            [](DBusConnection* on, DBusMessage* request, void* data) -> DBusHandlerResult {
+                Agent* agent = static_cast<Agent*>(data);
+                if (agent->vtable == 0 || agent->vtable->message_function == 0)
+                    return DBUS_HANDLER_RESULT_NOT_YET_HANDLED;
+                return internal::ConnectionLoop::of(on)->defer(request, agent->vtable->message_function,
+                                                               agent);
+            },
+            0, 0, 0, 0
+        };
         registered = vtable != 0 && dbus_connection_try_register_object_path(
-                                        connection, path.c_str(), vtable, this, error.get());
+                                        connection, path.c_str(), &kDeferred, this, error.get());
         Connection::unref(connection);  // the registration stays on the shared connection
     }
     if (!registered) {

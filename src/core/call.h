@@ -1,6 +1,8 @@
 #ifndef BTBUS_SRC_CORE_CALL_H
 #define BTBUS_SRC_CORE_CALL_H
 
+#include <mutex>
+
 #include <bluetooth/remote_object.h>
 
 #include "core/log.h"
@@ -59,12 +61,32 @@ int readReply(RemoteObject& object, Out* out) {
     return object.getReplyValue(*out);
 }
 
+// Marks an operation running on an object: a signal's decoding error, noted on
+// the object from a receiving thread meanwhile, does not change its outcome.
+class OperationScope {
+public:
+    explicit OperationScope(RemoteObject& object) : object_(object) {
+        std::lock_guard<std::mutex> hold(object_.errorLock);
+        ++object_.operationDepth;
+    }
+    ~OperationScope() {
+        std::lock_guard<std::mutex> hold(object_.errorLock);
+        --object_.operationDepth;
+    }
+    OperationScope(const OperationScope&) = delete;
+    OperationScope& operator=(const OperationScope&) = delete;
+
+private:
+    RemoteObject& object_;
+};
+
 // The frame every proxy operation runs: reset the error state, build the call,
 // append the arguments, send it, read the reply if it waits for one, and log the
 // error text once. Returns 0, or the first failing step's result (-1, or -2
 // from an object-path reply that carried an error text).
 template <typename Out, typename... A>
 int call(RemoteObject& object, const char* file, const Op& op, Out* out, const A&... args) {
+    OperationScope running(object);
     object.resetError();
     int result = object.newMessage(op.method);
     if (result == 0) result = appendAll(object, args...);

@@ -1,0 +1,112 @@
+#ifndef BTBUS_SRC_CORE_CONNECTION_LOOP_H
+#define BTBUS_SRC_CORE_CONNECTION_LOOP_H
+
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
+#include <deque>
+#include <mutex>
+
+#include <dbus/dbus.h>
+
+namespace Bluetooth {
+
+class RemoteObject;
+
+namespace internal {
+
+// The one loop of a bus connection: who reads the socket and dispatches, the
+// work that dispatching hands over (signals, the Agent's requests), the
+// receiving threads that run it, and the waits for replies beside them.
+//
+// Dispatching never runs callers' code: signals and deferred method calls are
+// queued and run by a receiving thread (or, for method calls, by a thread
+// waiting in a pending call), outside libdbus's dispatch lock. So whoever reads
+// the socket is never held up, and a thread waiting for a reply may read it
+// itself while every receiving thread is busy in a handler.
+class ConnectionLoop {
+public:
+    // The loop of connection, made on first use and kept as long as the
+    // process (shared connections live that long).
+    static ConnectionLoop* of(DBusConnection* connection);
+
+    enum End { kReplied, kTimedOut, kInterrupted, kClosed };
+
+    // Sends message and waits for its reply; a D-Bus error, a time-out or a
+    // closed connection gives null with error set. timeout as libdbus takes it.
+    DBusMessage* call(DBusMessage* message, int timeout, DBusError* error);
+    // Waits for pending to complete, at most timeout (libdbus's meaning), or
+    // until *interrupted is set. runMethodCalls: answer deferred method calls
+    // (the Agent's) meanwhile on this thread.
+    End wait(DBusPendingCall* pending, int timeout, bool runMethodCalls,
+             const std::atomic<int>* interrupted);
+
+    // Queues a method call for a thread that may run callers' code; the Agent's
+    // object path dispatches through this.
+    DBusHandlerResult defer(DBusMessage* message, DBusObjectPathMessageFunction function,
+                            void* data);
+
+    // A receiving thread: announce it before the thread starts (owner is then
+    // the dispatching object), run it on the thread.
+    void addReceiver(RemoteObject* owner);
+    void removeReceiver(RemoteObject* owner);  // its thread could not start
+    void receive();
+
+    // Every loop: the stop that ends receiving threads and drops later signals.
+    static void stopAll();
+    static bool stopped();
+    // owner is being destroyed: no loop dispatches with it any more.
+    static void forgetOwner(RemoteObject* owner);
+    // data is going away: its queued method calls are dropped, and a running
+    // one on another thread is waited for.
+    static void forgetMethodCalls(void* data);
+
+private:
+    struct Work {
+        DBusMessage* message;                    // one reference owned
+        DBusObjectPathMessageFunction function;  // null: a signal
+        void* data;
+    };
+    typedef std::chrono::steady_clock Clock;
+
+    explicit ConnectionLoop(DBusConnection* connection);
+
+    // Reads what the socket holds (waiting up to milliseconds, -1 without end)
+    // and dispatches it; runs with pumping_ set by the caller.
+    void pump(int milliseconds);
+    void dispatchAll();
+    void runWork(Work& work);
+    // Pops the first work item that may run on this thread; false if none.
+    bool takeWork(bool methodCallsOnly, Work& work);
+    void queue(const Work& work);
+    void wake();
+    bool mayPump(bool receiving, Clock::time_point now) const;
+
+    static DBusHandlerResult filter(DBusConnection*, DBusMessage* message, void* data);
+    static void onDispatchStatus(DBusConnection*, DBusDispatchStatus status, void* data);
+    static void onCompleted(DBusPendingCall*, void* data);
+
+    DBusConnection* const connection_;
+    int wake_[2];  // wakes the thread that polls the socket
+
+    std::mutex lock_;  // guards what follows
+    std::condition_variable changed_;  // a reply arrived, work queued, the pump freed, a stop
+    bool pumping_;                     // a thread reads and dispatches the connection
+    Clock::time_point pumpFreeSince_;
+    bool runningWork_;                 // a receiving thread runs work
+    std::deque<Work> work_;
+    int receivers_;
+    bool overflowLogged_;
+};
+
+// Marks what a callback uses (an object, an Agent), so that its destruction on
+// another thread waits for the callback to return. A thread never waits for
+// its own uses: a handler may destroy its own proxy.
+void beginUse(const void* key);
+void endUse(const void* key);
+void waitUnused(const void* key);
+
+}  // namespace internal
+}  // namespace Bluetooth
+
+#endif
