@@ -69,10 +69,10 @@ btbusctl adapters
 btbusctl show hci0
 
 step "A scan: devices appear; the phone walks away and disappears"
-echo "\$ btbusctl scan --timeout 3"
-"$build/tools/btbusctl/btbusctl" scan --timeout 3 &  # not through the function: its PID
+echo "\$ btbusctl scan --timeout 4"
+"$build/tools/btbusctl/btbusctl" scan --timeout 4 &  # not through the function: its PID
 scan=$!
-sleep 1.5
+sleep 1.2
 simulator SetInRange hci0 "$PHONE" false
 wait "$scan"
 scan=""

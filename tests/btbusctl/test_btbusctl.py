@@ -75,8 +75,8 @@ class BtbusctlTest(SimTestCase):
             (['audio', 'status', MOUSE], 1, "doesn't exist"),
             (['pair', KEYBOARD, '--pin', '1234'], 1, 'Authentication Failed'),
             (['pair', KEYBOARD, '--pin', '0000'], 0, lambda out: self.assertEqual(
-                [(r['request'], r['answer']) for r in out['requests']],
-                [('RequestPinCode', '0000'), ('Release', 'released')])),
+                [(r['request'], r['device'], r['answer']) for r in out['requests']][0],
+                ('RequestPinCode', KEYBOARD, '0000'))),
             (['pair', PHONE, '--reject'], 1, 'Authentication Failed'),
             (['pair', PHONE, '--capability', 'KeyboardOnly', '--passkey', '482913'], 0,
              lambda out: self.assertEqual(out['requests'][0]['request'], 'RequestPasskey')),
