@@ -1,6 +1,7 @@
 """The launcher's process handling, and the template run directly by dbusmock."""
 
 import os
+import shutil
 import signal
 import subprocess
 import tempfile
@@ -82,6 +83,7 @@ class LauncherTest(unittest.TestCase):
 
     def test_activated_services_see_the_private_buses_and_stop_with_the_launcher(self):
         services = tempfile.mkdtemp()
+        self.addCleanup(shutil.rmtree, services)
         seen = os.path.join(services, 'seen')
         with open(os.path.join(services, 'service.py'), 'w', encoding='utf-8') as f:
             f.write(ACTIVATED_SERVICE)
