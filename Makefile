@@ -2,7 +2,7 @@
 BUILD ?= build
 JOBS ?= $(shell nproc)
 
-.PHONY: all deps configure build check demo bench sanitize clean
+.PHONY: all deps configure build check demo bench sanitize tsan clean
 
 all: build
 
@@ -33,5 +33,13 @@ sanitize: deps
 	cmake --build $(BUILD)-sanitize -j $(JOBS)
 	cd $(BUILD)-sanitize && ctest --output-on-failure -j 2
 
+# The threaded tests again, built with ThreadSanitizer. libdbus itself is not
+# instrumented: tests/tsan.supp names what of it TSan cannot see through.
+tsan: deps
+	cmake -S . -B $(BUILD)-tsan -DCMAKE_BUILD_TYPE=Debug -DBTBUS_TSAN=ON -DBTBUS_BUILD_BENCHMARKS=OFF
+	cmake --build $(BUILD)-tsan -j $(JOBS) --target btbus_core_tests btbus_bluez_tests
+	cd $(BUILD)-tsan && TSAN_OPTIONS="suppressions=$(CURDIR)/tests/tsan.supp halt_on_error=1 second_deadlock_stack=1" \
+	  ctest --output-on-failure -j 2 -R "btbus_(core|bluez)_tests"
+
 clean:
-	rm -rf $(BUILD) $(BUILD)-sanitize
+	rm -rf $(BUILD) $(BUILD)-sanitize $(BUILD)-tsan

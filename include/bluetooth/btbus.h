@@ -6,11 +6,13 @@
 #include <bluetooth/agent.h>
 #include <bluetooth/audio.h>
 #include <bluetooth/audio_sink.h>
+#include <bluetooth/auto_connect.h>
 #include <bluetooth/bluez_object.h>
 #include <bluetooth/connection.h>
 #include <bluetooth/control.h>
 #include <bluetooth/dbus_object.h>
 #include <bluetooth/device.h>
+#include <bluetooth/fifo.h>
 #include <bluetooth/manager.h>
 #include <bluetooth/object_path.h>
 #include <bluetooth/remote_object.h>

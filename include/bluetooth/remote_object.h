@@ -25,12 +25,14 @@ template <typename F>
 class SignalHandler {
 public:
     SignalHandler(RemoteObject* object, const char* signalName, F function)
-        : object(object), signalName(signalName), function(function) {}
+        : object(object), signalName(signalName), function(function), registration(0) {}
     virtual ~SignalHandler() {}
 
     RemoteObject* object;
     std::string signalName;
     F function;
+    // Tells this registration from a later one at the same address.
+    unsigned long registration;
 };
 
 // Handler types, one per signal signature. The pointers handed to a handler are

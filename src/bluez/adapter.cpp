@@ -1,21 +1,13 @@
 #include <bluetooth/adapter.h>
 
-#include <cerrno>
 #include <cstdio>
-#include <memory>
 #include <string>
-
-#include <fcntl.h>
-#include <spawn.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <bluetooth/util.h>
 
 #include "bluez/signal_line.h"
 #include "core/call.h"
-
-extern char** environ;
+#include "util/process.h"
 
 BT_LOG_FILE("adapter.cpp");
 
@@ -60,52 +52,6 @@ std::string controllerName(const std::string& path) {
     return slash == std::string::npos ? path : path.substr(slash + 1);
 }
 
-// A program's standard output as a stream, started without a shell, and reaped
-// when the pipe is closed.
-class CommandPipe {
-public:
-    CommandPipe(const char* program, const char* const* argv) : stream_(0), pid_(-1) {
-        // posix_spawn reports a missing program only through the child's exit
-        // status, too late to tell "cannot start" from "printed nothing".
-        if (access(program, X_OK) != 0) return;
-        int fds[2];
-        if (pipe2(fds, O_CLOEXEC) != 0) return;
-        posix_spawn_file_actions_t actions;
-        posix_spawn_file_actions_init(&actions);
-        posix_spawn_file_actions_adddup2(&actions, fds[1], STDOUT_FILENO);
-        int failed = posix_spawn(&pid_, program, &actions, 0, const_cast<char* const*>(argv),
-                                 environ);
-        posix_spawn_file_actions_destroy(&actions);
-        close(fds[1]);
-        if (failed != 0) {
-            pid_ = -1;
-            close(fds[0]);
-            return;
-        }
-        stream_ = fdopen(fds[0], "r");
-        if (stream_ == 0) close(fds[0]);
-    }
-
-    ~CommandPipe() {
-        if (stream_ != 0) fclose(stream_);
-        if (pid_ > 0) {
-            int status = 0;
-            while (waitpid(pid_, &status, 0) < 0 && errno == EINTR) {
-            }
-        }
-    }
-
-    // Null when the program could not be started.
-    FILE* stream() const { return stream_; }
-
-private:
-    CommandPipe(const CommandPipe&) = delete;
-    CommandPipe& operator=(const CommandPipe&) = delete;
-
-    FILE* stream_;
-    pid_t pid_;
-};
-
 }  // namespace
 
 DeviceList::~DeviceList() {
@@ -114,7 +60,8 @@ DeviceList::~DeviceList() {
 
 Adapter::Adapter(const char* path) : BluezObject(path, "org.bluez.Adapter") {}
 
-Adapter::~Adapter() {}
+// Before this class's part is gone: a handler may look at the whole object.
+Adapter::~Adapter() { releaseHandlers(); }
 
 Adapter* Adapter::getAdapter(const char* path) { return hasBluetoothd() ? new Adapter(path) : 0; }
 
@@ -184,8 +131,9 @@ Dict* Adapter::getProperties() {
     if (properties == 0) return 0;
     std::string controller = controllerName(path);
     const char* const argv[] = { kHciconfig, controller.c_str(), "-a", 0 };
-    CommandPipe command(kHciconfig, argv);
-    if (command.stream() == 0) {
+    // Once the version is read, a hciconfig that hangs is killed after a grace period.
+    internal::Process command(kHciconfig, argv, true);
+    if (command.output() == 0) {
         internal::logError(kLogFile, kHciconfigLogLine, "Failed to get open(%s %s)", kHciconfig,
                            controller.c_str());
         return properties;
@@ -193,7 +141,7 @@ Dict* Adapter::getProperties() {
     Entry version(kHciVersionKey, std::string());
     char line[1024];
     char token[1024];
-    while (fgets(line, sizeof line, command.stream()) != 0) {
+    while (fgets(line, sizeof line, command.output()) != 0) {
         if (sscanf(line, "\tHCI Version: %1023s", token) == 1) {
             version.second = std::string(token);  // only the first word is kept
             break;

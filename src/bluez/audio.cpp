@@ -13,7 +13,8 @@ const internal::Op kDisconnect = { "Disconnect", internal::kOneWay, 73 };
 
 Audio::Audio(const char* path) : BluezObject(path, "org.bluez.Audio") {}
 
-Audio::~Audio() {}
+// Before this class's part is gone: a handler may look at the whole object.
+Audio::~Audio() { releaseHandlers(); }
 
 Audio* Audio::getAudio(const char* path) { return hasBluetoothd() ? new Audio(path) : 0; }
 

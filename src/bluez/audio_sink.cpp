@@ -25,7 +25,8 @@ const internal::SignalLine kSignals[] = {
 
 AudioSink::AudioSink(const char* path) : BluezObject(path, "org.bluez.AudioSink") {}
 
-AudioSink::~AudioSink() {}
+// Before this class's part is gone: a handler may look at the whole object.
+AudioSink::~AudioSink() { releaseHandlers(); }
 
 AudioSink* AudioSink::getAudioSink(const char* path) {
     return hasBluetoothd() ? new AudioSink(path) : 0;

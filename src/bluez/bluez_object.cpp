@@ -28,7 +28,8 @@ const internal::SignalLine kPropertyChanged = { "PropertyChanged", "", " was cha
 BluezObject::BluezObject(const char* path, const char* interface)
     : RemoteObject("org.bluez", path, interface, DBUS_BUS_SYSTEM) {}
 
-BluezObject::~BluezObject() {}
+// Before this class's part is gone: a handler may look at the whole object.
+BluezObject::~BluezObject() { releaseHandlers(); }
 
 Dict* BluezObject::getProperties() {
     std::unique_ptr<Dict> properties(new Dict);

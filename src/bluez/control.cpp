@@ -23,7 +23,8 @@ const internal::SignalLine kSignals[] = {
 
 Control::Control(const char* path) : BluezObject(path, "org.bluez.Control") {}
 
-Control::~Control() {}
+// Before this class's part is gone: a handler may look at the whole object.
+Control::~Control() { releaseHandlers(); }
 
 Control* Control::getControl(const char* path) { return hasBluetoothd() ? new Control(path) : 0; }
 

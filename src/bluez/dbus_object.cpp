@@ -14,7 +14,8 @@ DBusObject::DBusObject()
     : RemoteObject("org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
                    DBUS_BUS_SYSTEM) {}
 
-DBusObject::~DBusObject() {}
+// Before this class's part is gone: a handler may look at the whole object.
+DBusObject::~DBusObject() { releaseHandlers(); }
 
 std::vector<std::string>* DBusObject::listNames() {
     std::vector<std::string>* names = new std::vector<std::string>;

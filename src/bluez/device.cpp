@@ -21,7 +21,8 @@ const internal::SignalLine kDisconnectRequested = { "DisconnectRequested",
 
 Device::Device(const char* path) : BluezObject(path, "org.bluez.Device") {}
 
-Device::~Device() {}
+// Before this class's part is gone: a handler may look at the whole object.
+Device::~Device() { releaseHandlers(); }
 
 Device* Device::getDevice(const char* path) { return hasBluetoothd() ? new Device(path) : 0; }
 

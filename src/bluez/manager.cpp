@@ -33,7 +33,8 @@ AdapterList::~AdapterList() {
 
 Manager::Manager() : BluezObject("/", "org.bluez.Manager") {}
 
-Manager::~Manager() {}
+// Before this class's part is gone: a handler may look at the whole object.
+Manager::~Manager() { releaseHandlers(); }
 
 Manager* Manager::getManager() { return hasBluetoothd() ? new Manager : 0; }
 

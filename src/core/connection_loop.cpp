@@ -49,6 +49,12 @@ std::vector<ConnectionLoop*> gLoops;  // never freed: shared connections live as
 
 // The loop whose receiving thread this thread is; null on other threads.
 thread_local ConnectionLoop* tReceiving = 0;
+// Whether this thread is inside libdbus's dispatch (an object path of other
+// code than the Agent's is called there): a wait there could never end.
+thread_local bool tInDispatch = false;
+
+const char kInDispatchText[] =
+    "A reply cannot be waited for inside libdbus's dispatch (an object path's own handler)";
 
 // ---- uses that destruction waits for ----
 
@@ -70,14 +76,23 @@ std::map<ConnectionLoop*, RemoteObject*> gOwners;
 std::multimap<const void*, ConnectionLoop*> gStarting;
 
 // The notify of a waited-for pending call: the waiting thread takes the reply.
-struct Waiter {
-    ConnectionLoop* loop;
+// The waiting thread and libdbus each hold a reference: the notify may run
+// after the wait has ended (a wait also asks the call whether it completed).
+}  // namespace
+
+struct ConnectionLoop::Waiter {
     std::mutex* lock;
     std::condition_variable* changed;
     bool done;
+    std::atomic<int> references;
 };
 
-void freeWaiter(void* data) { delete static_cast<Waiter*>(data); }
+namespace {
+
+void releaseWaiter(void* data) {
+    ConnectionLoop::Waiter* waiter = static_cast<ConnectionLoop::Waiter*>(data);
+    if (--waiter->references == 0) delete waiter;
+}
 
 int pollFor(DBusConnection* connection, int wakeFd, int milliseconds, bool& socketReady) {
     struct pollfd fds[2];
@@ -209,9 +224,13 @@ DBusHandlerResult ConnectionLoop::defer(DBusMessage* message, DBusObjectPathMess
 }
 
 void ConnectionLoop::dispatchAll() {
+    tInDispatch = true;
     while (dbus_connection_dispatch(connection_) == DBUS_DISPATCH_DATA_REMAINS) {
     }
+    tInDispatch = false;
 }
+
+const char* ConnectionLoop::cannotWait() { return tInDispatch ? kInDispatchText : 0; }
 
 void ConnectionLoop::pump(int milliseconds) {
     if (dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_DATA_REMAINS) {
@@ -352,19 +371,32 @@ void ConnectionLoop::receive() {
 
 void ConnectionLoop::onCompleted(DBusPendingCall*, void* data) {
     Waiter* waiter = static_cast<Waiter*>(data);
-    std::lock_guard<std::mutex> hold(*waiter->lock);
-    waiter->done = true;
+    {
+        std::lock_guard<std::mutex> hold(*waiter->lock);
+        waiter->done = true;
+    }
     waiter->changed->notify_all();
+    // Orders this call before the waiter's release for ThreadSanitizer, which
+    // cannot see libdbus's own reference count.
+    waiter->references.fetch_add(0, std::memory_order_release);
 }
 
 ConnectionLoop::End ConnectionLoop::wait(DBusPendingCall* pending, int timeout, bool runMethodCalls,
                                          const std::atomic<int>* interrupted) {
     Waiter* waiter = new Waiter;
-    waiter->loop = this;
     waiter->lock = &lock_;
     waiter->changed = &changed_;
     waiter->done = false;
-    dbus_pending_call_set_notify(pending, &onCompleted, waiter, &freeWaiter);
+    waiter->references = 2;
+    if (!dbus_pending_call_set_notify(pending, &onCompleted, waiter, &releaseWaiter))
+        releaseWaiter(waiter);  // libdbus holds none
+    End end = waitFor(pending, waiter, timeout, runMethodCalls, interrupted);
+    releaseWaiter(waiter);
+    return end;
+}
+
+ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, const Waiter* waiter, int timeout,
+                                            bool runMethodCalls, const std::atomic<int>* interrupted) {
     bool endless = timeout == DBUS_TIMEOUT_INFINITE;
     Clock::time_point deadline =
         Clock::now() + std::chrono::milliseconds(timeout < 0 ? kDefaultTimeoutMs : timeout);
@@ -378,6 +410,7 @@ ConnectionLoop::End ConnectionLoop::wait(DBusPendingCall* pending, int timeout, 
         bool completed = dbus_pending_call_get_completed(pending);
         hold.lock();
         if (completed) return kReplied;
+        if (!dbus_connection_get_is_connected(connection_)) return kClosed;
         if (interrupted != 0 && interrupted->load() != 0) return kInterrupted;
         Clock::time_point now = Clock::now();
         if (!endless && now >= deadline) return kTimedOut;
@@ -407,6 +440,10 @@ ConnectionLoop::End ConnectionLoop::wait(DBusPendingCall* pending, int timeout, 
 }
 
 DBusMessage* ConnectionLoop::call(DBusMessage* message, int timeout, DBusError* error) {
+    if (const char* why = cannotWait()) {
+        dbus_set_error_const(error, DBUS_ERROR_FAILED, why);
+        return 0;
+    }
     DBusPendingCall* pending = 0;
     if (!dbus_connection_send_with_reply(connection_, message, &pending, timeout) || pending == 0) {
         dbus_set_error_const(error, DBUS_ERROR_DISCONNECTED, "Connection is closed");
@@ -432,6 +469,11 @@ DBusMessage* ConnectionLoop::call(DBusMessage* message, int timeout, DBusError* 
         dbus_set_error_const(error, DBUS_ERROR_NO_REPLY, kNoReplyText);
     }
     return reply;
+}
+
+size_t ConnectionLoop::queued() {
+    std::lock_guard<std::mutex> hold(lock_);
+    return work_.size();
 }
 
 void ConnectionLoop::stopAll() {

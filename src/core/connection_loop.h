@@ -31,6 +31,8 @@ public:
     static ConnectionLoop* of(DBusConnection* connection);
 
     enum End { kReplied, kTimedOut, kInterrupted, kClosed };
+    // What the notify of a waited-for call shares with the waiting thread.
+    struct Waiter;
 
     // Sends message and waits for its reply; a D-Bus error, a time-out or a
     // closed connection gives null with error set. timeout as libdbus takes it.
@@ -40,6 +42,10 @@ public:
     // (the Agent's) meanwhile on this thread.
     End wait(DBusPendingCall* pending, int timeout, bool runMethodCalls,
              const std::atomic<int>* interrupted);
+
+    // Why this thread cannot wait for a reply now (it is inside libdbus's
+    // dispatch), or null.
+    static const char* cannotWait();
 
     // Queues a method call for a thread that may run callers' code; the Agent's
     // object path dispatches through this.
@@ -51,6 +57,9 @@ public:
     void addReceiver(RemoteObject* owner);
     void removeReceiver(RemoteObject* owner);  // its thread could not start
     void receive();
+
+    // Work waiting for a thread to run it.
+    size_t queued();
 
     // Every loop: the stop that ends receiving threads and drops later signals.
     static void stopAll();
@@ -81,6 +90,8 @@ private:
     void queue(const Work& work);
     void wake();
     bool mayPump(bool receiving, Clock::time_point now) const;
+    End waitFor(DBusPendingCall* pending, const Waiter* waiter, int timeout, bool runMethodCalls,
+                const std::atomic<int>* interrupted);
 
     static DBusHandlerResult filter(DBusConnection*, DBusMessage* message, void* data);
     static void onDispatchStatus(DBusConnection*, DBusDispatchStatus status, void* data);

@@ -38,6 +38,8 @@ int RemoteObject::sendMessagePending() {
     DBusPendingCall* pending = 0;
     if (const char* why = cannotSend()) {
         result = fail(11, why);
+    } else if (const char* inDispatch = internal::ConnectionLoop::cannotWait()) {
+        result = fail(11, inDispatch);
     } else if (!dbus_connection_send_with_reply(connection, message, &pending, -1) || pending == 0) {
         result = fail(11, error.text());  // libdbus sets no error text here
     } else {

@@ -32,6 +32,10 @@ bool readTexts(DBusMessageIter& array, std::vector<std::string>& values) {
     return true;
 }
 
+// Room made for a dictionary at once: BlueZ's property replies hold 10 to 20
+// entries, and growing entry by entry moves every entry several times.
+const size_t kEntriesGuess = 16;
+
 }  // namespace
 
 int decodeName(DBusMessageIter& iterator, std::string& name) {
@@ -53,8 +57,9 @@ int decodeName(DBusMessageIter& iterator, std::string& name) {
 
 int decodeValue(DBusMessageIter& iterator, Variant& value) {
     int type = typeOf(iterator);
+    VariantBase& held = value;  // assigned in place, without a temporary Variant
     if (type == DBUS_TYPE_STRING) {
-        value = std::string(readText(iterator));
+        held = std::string(readText(iterator));
         return 0;
     }
     if (type != DBUS_TYPE_VARIANT) return 4;
@@ -64,29 +69,29 @@ int decodeValue(DBusMessageIter& iterator, Variant& value) {
     case DBUS_TYPE_UINT32: {
         dbus_uint32_t number = 0;
         dbus_message_iter_get_basic(&inner, &number);
-        value = static_cast<unsigned int>(number);
+        held = static_cast<unsigned int>(number);
         return 0;
     }
     case DBUS_TYPE_UINT16: {
         dbus_uint16_t number = 0;
         dbus_message_iter_get_basic(&inner, &number);
-        value = static_cast<unsigned short>(number);
+        held = static_cast<unsigned short>(number);
         return 0;
     }
     case DBUS_TYPE_BOOLEAN: {
         dbus_bool_t truth = FALSE;
         dbus_message_iter_get_basic(&inner, &truth);
-        value = truth != 0;
+        held = truth != 0;
         return 0;
     }
     case DBUS_TYPE_STRING:
     case DBUS_TYPE_OBJECT_PATH:
-        value = std::string(readText(inner));
+        held = std::string(readText(inner));
         return 0;
     case DBUS_TYPE_INT16: {
         dbus_int16_t number = 0;
         dbus_message_iter_get_basic(&inner, &number);
-        value = static_cast<int>(number);
+        held = static_cast<int>(number);
         return 0;
     }
     case DBUS_TYPE_ARRAY: {
@@ -97,8 +102,8 @@ int decodeValue(DBusMessageIter& iterator, Variant& value) {
             elementType != DBUS_TYPE_OBJECT_PATH)
             return 4;
         // Filled in place: the list is not copied.
-        value = std::vector<std::string>();
-        readTexts(inner, boost::get<std::vector<std::string> >(value));
+        held = std::vector<std::string>();
+        readTexts(inner, boost::get<std::vector<std::string> >(held));
         return 0;
     }
     default:
@@ -109,6 +114,7 @@ int decodeValue(DBusMessageIter& iterator, Variant& value) {
 EntriesResult decodeEntries(DBusMessageIter& array, Dict& dict) {
     DBusMessageIter element;
     dbus_message_iter_recurse(&array, &element);
+    if (dict.capacity() - dict.size() < kEntriesGuess) dict.reserve(dict.size() + kEntriesGuess);
     for (; typeOf(element) == DBUS_TYPE_DICT_ENTRY; dbus_message_iter_next(&element)) {
         DBusMessageIter field;
         dbus_message_iter_recurse(&element, &field);

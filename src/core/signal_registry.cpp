@@ -30,14 +30,15 @@ std::mutex gListsLock;
 // Counts unlinks: a walk that sees it change checks that a handler it found
 // before a call is still listed.
 unsigned long gUnlinks = 0;
+unsigned long gRegistrations = 0;
 
 int typeOf(DBusMessageIter& iterator) { return dbus_message_iter_get_arg_type(&iterator); }
 
 template <typename F>
-bool stillListed(const std::list<SignalHandler<F> >& list, const SignalHandler<F>* node) {
+bool stillListed(const std::list<SignalHandler<F> >& list, unsigned long registration) {
     for (typename std::list<SignalHandler<F> >::const_iterator it = list.begin(); it != list.end();
          ++it)
-        if (&*it == node) return true;
+        if (it->registration == registration) return true;
     return false;
 }
 
@@ -49,7 +50,7 @@ bool stillListed(const std::list<SignalHandler<F> >& list, const SignalHandler<F
 template <typename F, typename Visit>
 void forMatching(std::list<SignalHandler<F> >& list, DBusMessage* message, Visit visit) {
     struct Match {
-        const SignalHandler<F>* node;
+        unsigned long registration;
         RemoteObject* object;
         F function;
     };
@@ -59,7 +60,7 @@ void forMatching(std::list<SignalHandler<F> >& list, DBusMessage* message, Visit
         std::lock_guard<std::mutex> hold(gListsLock);
         for (typename std::list<SignalHandler<F> >::iterator it = list.begin(); it != list.end(); ++it)
             if (dbus_message_is_signal(message, it->object->getInterface(), it->signalName.c_str())) {
-                Match match = { &*it, it->object, it->function };
+                Match match = { it->registration, it->object, it->function };
                 matches.push_back(match);
             }
         unlinks = gUnlinks;
@@ -67,7 +68,7 @@ void forMatching(std::list<SignalHandler<F> >& list, DBusMessage* message, Visit
     for (size_t i = 0; i < matches.size(); ++i) {
         {
             std::lock_guard<std::mutex> hold(gListsLock);
-            if (gUnlinks != unlinks && !stillListed(list, matches[i].node)) continue;
+            if (gUnlinks != unlinks && !stillListed(list, matches[i].registration)) continue;
             internal::beginUse(matches[i].object);  // its destruction now waits for the call
         }
         bool goOn = visit(matches[i].object, matches[i].function);
@@ -121,6 +122,7 @@ int RemoteObject::addSignalHandler(std::list<SignalHandler<F> >& list, const cha
     }
     std::lock_guard<std::mutex> hold(gListsLock);
     list.push_back(SignalHandler<F>(this, signalName, function));
+    list.back().registration = ++gRegistrations;
     return 0;
 }
 

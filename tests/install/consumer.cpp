@@ -1,4 +1,5 @@
 // A program of a library user: built as C++11 against the installed headers.
+#include <cstdlib>
 #include <iostream>
 
 #include <bluetooth/btbus.h>
@@ -10,6 +11,9 @@ int main() {
     Bluetooth::Dict* back = Bluetooth::stringDivideToDict(Bluetooth::dictConquerToString(dict, separator), separator);
     bool ok = back != 0 && back->size() == 1 && Bluetooth::find(back, "Class") == "7936";
     delete back;
+    char* address = Bluetooth::getAddressFromPath("/org/bluez/1/hci0/dev_00_11_22_33_44_55");
+    ok = ok && address != 0 && std::string(address) == "00:11:22:33:44:55";
+    free(address);
 
     // No bus is reachable here: the object reports that through its error state.
     Bluetooth::RemoteObject manager("org.bluez", "/", "org.bluez.Manager", DBUS_BUS_SYSTEM);

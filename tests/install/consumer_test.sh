@@ -10,7 +10,7 @@ here=$(cd "$(dirname "$0")" && pwd)
 
 rm -rf "$prefix"
 cmake --install "$build" --prefix "$prefix" >/dev/null
-for header in connection object_path remote_object util variant btbus; do
+for header in connection object_path remote_object util variant fifo auto_connect btbus; do
     test -f "$prefix/include/bluetooth/$header.h" || { echo "missing header $header.h"; exit 1; }
 done
 pc=$(find "$prefix" -name btbus.pc)

@@ -43,6 +43,18 @@ size_t LogCapture::countEndingWith(const std::string& text) const {
     });
 }
 
+std::vector<std::string> LogCapture::from(const std::string& file) const {
+    std::lock_guard<std::mutex> lock(gLock);
+    std::vector<std::string> messages;
+    for (const std::string& line : gLines) {
+        std::string::size_type digits = file.size() + 1, blank = line.find(' ');
+        if (line.compare(0, digits, file + ":") == 0 && blank != std::string::npos && blank > digits &&
+            line.find_first_not_of("0123456789", digits) == blank)
+            messages.push_back(line.substr(blank + 1));
+    }
+    return messages;
+}
+
 void LogCapture::clear() {
     std::lock_guard<std::mutex> lock(gLock);
     gLines.clear();

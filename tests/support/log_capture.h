@@ -17,6 +17,8 @@ public:
     bool contains(const std::string& line) const { return count(line) != 0; }
     // Lines that end with text (the "file:line " prefix aside).
     size_t countEndingWith(const std::string& text) const;
+    // The messages of the lines "file:<line> message" from file, in order.
+    std::vector<std::string> from(const std::string& file) const;
     void clear();
 
     LogCapture(const LogCapture&) = delete;

@@ -118,9 +118,11 @@ void requireDbusmock() {
 std::string scratchDir() {
     static std::string dir;
     if (dir.empty()) {
-        dir = std::string(BTBUS_TEST_TMP) + "/run-" + std::to_string(getpid());
+        // Not named by the pid alone: children in process namespaces of their
+        // own share pids.
+        std::string name = std::string(BTBUS_TEST_TMP) + "/run-" + std::to_string(getpid()) + "-XXXXXX";
         mkdir(BTBUS_TEST_TMP, 0755);
-        mkdir(dir.c_str(), 0700);
+        if (mkdtemp(&name[0]) != nullptr) dir = name;
     }
     return dir;
 }

@@ -1,7 +1,9 @@
 // Adapter against bluez4-sim: one-way requests through the call log, queries,
 // device creation and the adapter's signals.
 #include <atomic>
+#include <map>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -97,6 +99,7 @@ TEST_F(AnAdapter, CreatesADeviceOnceAndLogsWhyItCannotOtherwise) {
     EXPECT_EQ(phone->getPath(), sim::devicePath(kPhone));
     LogCapture log;
     EXPECT_EQ(adapter->createDevice(kPhone), nullptr);
+    EXPECT_EQ(adapter->getErrorName(), "org.bluez.Error.AlreadyExists");
     EXPECT_EQ(adapter->createDevice(kFarLaptop), nullptr);
     EXPECT_EQ(adapter->createDevice("not an address"), nullptr);
     EXPECT_EQ(log.lines(), (std::vector<std::string>{ "adapter.cpp:274 Already Exists",
@@ -188,26 +191,28 @@ TEST_F(AnAdapter, PrintsFoundAndDisappearedDevicesDuringDiscovery) {
 
 TEST_F(AnAdapter, HandsFoundDevicesPropertiesToItsHandler) {
     sim::receivingLoop();
-    static std::vector<std::pair<std::string, Dict> > found;
-    found.clear();
-    ASSERT_EQ(adapter->setDeviceFoundHandler([](RemoteObject* o, const char* address, const Dict* d) {
-                  (void)o;
-                  found.emplace_back(address, *d);
+    // Written on the receiving thread, read here.
+    static std::mutex lock;
+    static std::map<std::string, Dict> found;
+    {
+        std::lock_guard<std::mutex> hold(lock);
+        found.clear();
+    }
+    ASSERT_EQ(adapter->setDeviceFoundHandler([](RemoteObject*, const char* address, const Dict* d) {
+                  std::lock_guard<std::mutex> hold(lock);
+                  found.emplace(address, *d);
               }), 0);
     ASSERT_EQ(adapter->startDiscovery(), 0);
     ASSERT_TRUE(waitUntil([] {
-        for (auto& f : found)
-            if (f.first == kKeyboard) return true;
-        return false;
+        std::lock_guard<std::mutex> hold(lock);
+        return found.count(kKeyboard) != 0;
     }));
     adapter->stopDiscovery();
-    for (auto& f : found) {
-        if (f.first != kKeyboard) continue;
-        EXPECT_EQ(Bluetooth::find(&f.second, "Address"), kKeyboard);
-        EXPECT_EQ(Bluetooth::find(&f.second, "LegacyPairing"), "1");
-        EXPECT_EQ(Bluetooth::find(&f.second, "RSSI"), "-61");
-        break;
-    }
+    std::lock_guard<std::mutex> hold(lock);
+    const Dict& keyboard = found[kKeyboard];
+    EXPECT_EQ(Bluetooth::find(&keyboard, "Address"), kKeyboard);
+    EXPECT_EQ(Bluetooth::find(&keyboard, "LegacyPairing"), "1");
+    EXPECT_EQ(Bluetooth::find(&keyboard, "RSSI"), "-61");
 }
 
 }  // namespace

@@ -77,11 +77,13 @@ TEST_F(ADevice, SendsCancelDiscoveryAndATrustedFlagWithoutWaiting) {
     EXPECT_EQ(mouse->cancelDiscovery(), 0);  // refused: none running
     EXPECT_EQ(mouse->setProperty("Trusted", Variant(false)), 0);
     EXPECT_EQ(mouse->setProperty("Alias", Variant(3u)), 0);  // refused: wrong type
-    ASSERT_TRUE(sim::waitForLogLine("SetProperty(Alias"));
+    EXPECT_EQ(mouse->setProperty("Alias", "kitchen-nas"), 0);  // text goes as a string
+    ASSERT_TRUE(sim::waitForLogLine("SetProperty(Alias, kitchen-nas"));
     EXPECT_EQ(sim::logLinesWith(" org.bluez.Device."),
               (std::vector<std::string>{ path + " org.bluez.Device.CancelDiscovery()",
                                          path + " org.bluez.Device.SetProperty(Trusted, false)",
-                                         path + " org.bluez.Device.SetProperty(Alias, 3)" }));
+                                         path + " org.bluez.Device.SetProperty(Alias, 3)",
+                                         path + " org.bluez.Device.SetProperty(Alias, kitchen-nas)" }));
     EXPECT_TRUE(log.lines().empty());
 }
 

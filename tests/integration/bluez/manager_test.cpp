@@ -1,5 +1,6 @@
 // Manager and the factories against bluez4-sim.
 #include <memory>
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -134,17 +135,23 @@ TEST_F(AManager, ListAdaptersNeitherResetsTheErrorStateNorLogs) {
     EXPECT_TRUE(log.lines().empty());
 }
 
-// Handlers that record what they were given, for the signal tests.
+// Handlers that record what they were given, for the signal tests: written on
+// the receiving thread, read here.
+std::mutex gLock;
 std::vector<std::string> gPaths;
 RemoteObject* gReceiver = nullptr;
 void recordPath(RemoteObject* object, const ObjectPath* path) {
+    std::lock_guard<std::mutex> hold(gLock);
     gReceiver = object;
     gPaths.push_back(path->str());
 }
 
 TEST_F(AManager, ReportsAdaptersComingAndGoingToItsHandlers) {
     sim::receivingLoop();
-    gPaths.clear();
+    {
+        std::lock_guard<std::mutex> hold(gLock);
+        gPaths.clear();
+    }
     ASSERT_EQ(manager->setAdapterAddedHandler(nullptr), 0);
     ASSERT_EQ(manager->setDefaultAdapterChangedHandler(nullptr), 0);
     ASSERT_EQ(manager->setAdapterRemovedHandler(nullptr), 0);
@@ -154,9 +161,13 @@ TEST_F(AManager, ReportsAdaptersComingAndGoingToItsHandlers) {
     testing::internal::CaptureStdout();
     sim::removeAdapter("hci0");  // default gone, no other adapter: no DefaultAdapterChanged
     std::string second = sim::addAdapter("hci1", kSecondAddress);
-    bool arrived = waitUntil([] { return gPaths.size() >= 3; });
+    bool arrived = waitUntil([] {
+        std::lock_guard<std::mutex> hold(gLock);
+        return gPaths.size() >= 3;
+    });
     std::string out = testing::internal::GetCapturedStdout();
     ASSERT_TRUE(arrived);
+    std::lock_guard<std::mutex> hold(gLock);
     EXPECT_EQ(gPaths, (std::vector<std::string>{ defaultPath, second, second }));
     EXPECT_EQ(gReceiver, manager.get());
     EXPECT_EQ(out, defaultPath + " was removed by /\n" + second + " was added by /\n" +

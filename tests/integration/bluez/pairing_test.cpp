@@ -310,4 +310,64 @@ TEST_F(APairing, AgentPathIsRegisteredOncePerProcess) {
                                                       "agent.cpp:65 Failed to unregister agent path from dbus." }));
 }
 
+TEST_F(APairing, AnswersABlockingPairingCallMadeBeforeAnyLoopStarted) {
+    if (btbus_test::childRole() != "before-loop") {
+        EXPECT_EQ(btbus_test::runInChild("APairing.AnswersABlockingPairingCallMadeBeforeAnyLoopStarted",
+                                         "before-loop"), 0);
+        return;
+    }
+    ASSERT_FALSE(sim::receivingLoopRunning());
+    ASSERT_EQ(agent.setPasskeyValue("0000"), 0);
+    // A plain blocking call answers nobody's requests: the agent's PIN request
+    // waits for the loop started after the call was made.
+    std::thread caller([this] {
+        adapter->newMessage("CreatePairedDevice");
+        adapter->append(kKeyboard);
+        adapter->append(ObjectPath(agent.getPath()));
+        adapter->append(agent.getCapability());
+        auto start = std::chrono::steady_clock::now();
+        EXPECT_EQ(adapter->sendMessage(true, -1), 0) << adapter->getErrorMessage();
+        EXPECT_LT(std::chrono::steady_clock::now() - start, 5s);
+    });
+    std::this_thread::sleep_for(300ms);
+    sim::receivingLoop();
+    caller.join();
+    ObjectPath device;
+    EXPECT_EQ(adapter->getReplyValue(device), 0);
+    EXPECT_EQ(device.str(), sim::devicePath(kKeyboard));
+}
+
+TEST_F(APairing, LeavesOtherThreadsCallsPromptWhileTheAgentSitsOnItsDelay) {
+    sim::receivingLoop();
+    ASSERT_EQ(agent.setPasskeyValue("0000"), 0);
+    ASSERT_EQ(agent.setPasskeyDelay(2), 0);
+    ASSERT_EQ(adapter->registerAgent(agent), 0);
+    ASSERT_TRUE(sim::waitForLogLine("RegisterAgent"));
+    // The receiving thread sleeps in the agent's answer meanwhile.
+    std::thread pairing([] { EXPECT_EQ(sim::startIncomingPairing("hci0", kKeyboard), "accepted"); });
+    ASSERT_TRUE(waitUntil([] { return reached("RequestPinCode"); }));
+    std::unique_ptr<Adapter> other(Adapter::getAdapter(adapter->getPath()));
+    for (int i = 0; i < 5; ++i) {
+        auto start = std::chrono::steady_clock::now();
+        std::unique_ptr<Dict> properties(other->getProperties());
+        EXPECT_TRUE(properties != nullptr);
+        EXPECT_LT(std::chrono::steady_clock::now() - start, 250ms) << "call " << i;
+    }
+    pairing.join();
+}
+
+TEST_F(APairing, AgentDestroyedWhileRegisteredFreesItsPath) {
+    sim::receivingLoop();
+    agent.unregisterPath();
+    auto forgotten = std::make_unique<Agent>();
+    ASSERT_EQ(forgotten->registerPath(), 0);
+    std::string path = forgotten->getPath();
+    forgotten.reset();  // without unregisterPath
+    RawCaller peer;
+    ASSERT_TRUE(peer.ok());
+    EXPECT_EQ(peer.call(adapter->getConnectionName(), path.c_str(), "Release", 3000, false),
+              "org.freedesktop.DBus.Error.UnknownMethod");
+    EXPECT_EQ(agent.registerPath(), 0);
+}
+
 }  // namespace
