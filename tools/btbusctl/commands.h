@@ -35,6 +35,13 @@ int volume(const Options& options, const std::string& direction, const std::stri
 
 int watch(const Options& options);
 
+// action: show, enable, disable, add, remove, reload, pause or resume; device
+// only for add and remove.
+int autoConnect(const Options& options, const std::string& action, const std::string& device);
+// wait: short, default or long.
+int remoteName(const Options& options, const std::string& address, const std::string& wait);
+int restartDaemon(const Options& options);
+
 }  // namespace btbusctl
 
 #endif

@@ -101,6 +101,22 @@ int main(int argc, char** argv) {
     app.add_subcommand("watch", "report property changes, devices and audio events until Ctrl-C")
         ->callback([&] { run = [&] { return watch(options); }; });
 
+    CLI::App* autoconnect = app.add_subcommand("autoconnect", "the adapter's auto-connect list and its daemon");
+    autoconnect->add_option("action", action, "show, enable, disable, add, remove, reload, pause or resume")
+        ->required()
+        ->check(CLI::IsMember({"show", "enable", "disable", "add", "remove", "reload", "pause", "resume"}));
+    autoconnect->add_option("address", address, "device address, for add and remove");
+    autoconnect->callback([&] { run = [&] { return autoConnect(options, action, address); }; });
+    CLI::App* naming = app.add_subcommand("name", "read a device's name over HCI");
+    naming->add_option("address", address, "device address")->required();
+    std::string wait = "default";
+    naming->add_option("--wait", wait, "how long to wait for the answer: short, default or long")
+        ->check(CLI::IsMember({"short", "default", "long"}))
+        ->capture_default_str();
+    naming->callback([&] { run = [&] { return remoteName(options, address, wait); }; });
+    app.add_subcommand("restart-daemon", "restart bluetoothd when an adapter is attached (as root)")
+        ->callback([&] { run = [&] { return restartDaemon(options); }; });
+
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {

@@ -104,6 +104,13 @@ std::unique_ptr<Adapter> adapter(Manager& manager, const Options& options) {
     return found;
 }
 
+std::pair<std::string, std::string> adapterIdentity(const Options& options) {
+    std::unique_ptr<Manager> bluez = manager();
+    std::unique_ptr<Adapter> chosen = adapter(*bluez, options);
+    Dict props = properties(*chosen);
+    return std::make_pair(shortName(chosen->getPath()), find(&props, "Address"));
+}
+
 std::string shortName(const std::string& path) {
     std::string last = path.substr(path.rfind('/') + 1);
     if (last.compare(0, 4, "dev_") != 0) return last;

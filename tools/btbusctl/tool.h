@@ -72,6 +72,8 @@ bool stopRequested();  // one arrived and was not consumed yet; does not wait
 std::unique_ptr<Bluetooth::Manager> manager();
 // The adapter that -a names, else BlueZ's default one.
 std::unique_ptr<Bluetooth::Adapter> adapter(Bluetooth::Manager& manager, const Options& options);
+// The name ("hci0") and address of the adapter that -a names, else of the default one.
+std::pair<std::string, std::string> adapterIdentity(const Options& options);
 // "hci0" for ".../hci0"; "00:11:.." for ".../dev_00_11_..".
 std::string shortName(const std::string& path);
 // A device the adapter knows, or a Failure with BlueZ's answer.
