@@ -5,10 +5,38 @@
 set -eu
 top=$(cd "$(dirname "$0")/.." && pwd)
 build=$(cd "${1:-build}" && pwd)
+
+HEADSET=00:0D:3C:A1:B2:C3
+KEYBOARD=00:12:A1:B0:00:42
+PHONE=5C:F3:70:61:A0:17
+ADAPTER=00:1A:7D:DA:71:13
+
+step() {
+    stop_if_interrupted
+    printf '\n== %s\n' "$*"
+}
+# Shows the command line, then runs btbusctl.
+btbusctl() {
+    echo "\$ btbusctl $*"
+    "$build/tools/btbusctl/btbusctl" "$@"
+    stop_if_interrupted
+}
+interrupted=""
+stop_if_interrupted() { [ -z "$interrupted" ] || exit 130; }
+
+# The auto-connect step, run again by the demo in a private mount namespace.
+if [ "${2:-}" = "--autoconnect" ]; then
+    btbusctl autoconnect add "$HEADSET"
+    btbusctl autoconnect enable
+    echo "\$ cat /etc/bluetooth/autoconnect/$ADAPTER"
+    cat "/etc/bluetooth/autoconnect/$ADAPTER"
+    echo
+    exit 0
+fi
+
 work=$(mktemp -d "$build/demo.XXXXXX")
 sim=""
 scan=""
-interrupted=""
 finish() {
     status=$?
     trap - EXIT INT TERM
@@ -24,22 +52,7 @@ trap finish EXIT
 # Noted only: the shell goes on waiting for the command in the foreground,
 # which Ctrl-C stops too, and stops at the next check.
 trap 'interrupted=1' INT TERM
-stop_if_interrupted() { [ -z "$interrupted" ] || exit 130; }
 
-HEADSET=00:0D:3C:A1:B2:C3
-KEYBOARD=00:12:A1:B0:00:42
-PHONE=5C:F3:70:61:A0:17
-
-step() {
-    stop_if_interrupted
-    printf '\n== %s\n' "$*"
-}
-# Shows the command line, then runs btbusctl.
-btbusctl() {
-    echo "\$ btbusctl $*"
-    "$build/tools/btbusctl/btbusctl" "$@"
-    stop_if_interrupted
-}
 # Drives the simulator the way a radio neighbourhood would change.
 simulator() {
     gdbus call --system --dest org.bluez --object-path /org/btbus/Simulator \
@@ -89,5 +102,14 @@ btbusctl --json audio status "$HEADSET"
 
 step "The devices the adapter knows now"
 btbusctl devices
+
+step "Auto-connect for the headset, in a private mount namespace: the host's /etc and /tmp stay untouched"
+if unshare -m true 2>/dev/null; then
+    mkdir "$work/mounts"
+    "$top/scripts/in-private-mounts.sh" "$work/mounts" "$0" "$build" --autoconnect
+    stop_if_interrupted
+else
+    echo "skipped: this machine allows no private mount namespace here (unshare -m needs root)"
+fi
 
 step "Done: stopping bluez4-sim and its buses"
