@@ -7,11 +7,17 @@ import json
 import os
 import signal
 import subprocess
+import tempfile
 import unittest
 
 from simharness import SimTestCase, run_until
 
 BTBUSCTL = os.environ['BTBUSCTL']
+IN_PRIVATE_MOUNTS = os.path.join(os.path.dirname(__file__), '..', '..', 'scripts', 'in-private-mounts.sh')
+# Runs the commands of argv[1] (JSON) and prints their [status, stdout, stderr] as JSON.
+RUNNER = ('import json, subprocess, sys\n'
+          'done = [subprocess.run(c, capture_output=True, text=True) for c in json.loads(sys.argv[1])]\n'
+          'print(json.dumps([[d.returncode, d.stdout, d.stderr] for d in done]))')
 ADAPTER = 'org.bluez.Adapter'
 HEADSET, KEYBOARD, PHONE, MOUSE = '00:0D:3C:A1:B2:C3', '00:12:A1:B0:00:42', '5C:F3:70:61:A0:17', '00:1F:20:AB:CD:EF'
 
@@ -39,8 +45,20 @@ class BtbusctlTest(SimTestCase):
     def property(self, name):
         return self.call(self.adapter, ADAPTER, 'GetProperties')[name]
 
+    def check(self, cases, run):
+        """Cases are (arguments, exit status, check of the parsed output or a text of stderr);
+        run gives the results of all their arguments, in order."""
+        for (args, status, check), (code, out, err) in zip(cases, run([args for args, _, _ in cases])):
+            with self.subTest(args=args):
+                self.assertEqual(code, status, err)
+                if callable(check):
+                    check(json.loads(out) if args[0] == '--json' else out)
+                else:
+                    self.assertEqual(out, '')
+                    self.assertIn(check, err)
+
     def test_one_shot_commands(self):
-        """(arguments, exit status, check of the parsed output or of stderr), run in order."""
+        """Run in order, each with --json."""
         cases = [
             (['adapters'], 0, lambda out: self.assertEqual(
                 [(a['adapter'], a['address'], a['powered'], a['default']) for a in out],
@@ -95,16 +113,39 @@ class BtbusctlTest(SimTestCase):
             (['pair', KEYBOARD, '--passkey', 'abc'], 2, '--passkey'),
             (['pair', KEYBOARD, '--capability', 'Telepathy'], 2, 'Telepathy'),
             (['scan', '--timeout', '-3'], 2, '--timeout'),
+            (['autoconnect', 'add'], 2, 'needs an address'),
+            (['autoconnect', 'reload', HEADSET], 2, 'takes no address'),
+            (['name', HEADSET, '--wait', 'forever'], 2, 'forever not in'),
+            (['name', HEADSET, '--wait', 'short'], 1, 'over HCI'),
         ]
-        for args, status, check in cases:
-            with self.subTest(args=args):
-                code, out, err = self.btbusctl('--json', *args)
-                self.assertEqual(code, status, err)
-                if callable(check):
-                    check(json.loads(out))
-                else:
-                    self.assertEqual(out, '')
-                    self.assertIn(check, err)
+        self.check([(['--json', *args], status, check) for args, status, check in cases],
+                   lambda commands: (self.btbusctl(*args) for args in commands))  # each checked before the next
+
+    def test_autoconnect_and_restart_in_private_mounts(self):
+        if os.geteuid() != 0 or subprocess.run(['unshare', '-m', 'true'], capture_output=True).returncode:
+            self.skipTest("needs root and 'unshare -m' to keep /etc and /tmp private")
+        file = '/etc/bluetooth/autoconnect/00:1A:7D:DA:71:13'
+        cases = [(['--json', 'autoconnect', 'show'], 0, lambda out: self.assertEqual(
+                      (out['enabled'], out['devices'], out['file']), (False, [], file))),
+                 (['--json', 'autoconnect', 'add', MOUSE.lower()], 0,
+                  lambda out: self.assertEqual(out['devices'], [MOUSE])),
+                 (['autoconnect', 'add', HEADSET], 1, 'Does Not Exist'),
+                 (['--json', 'autoconnect', 'enable'], 0, lambda out: self.assertTrue(out['enabled'])),
+                 (['cat', file], 0, lambda out: self.assertEqual(out, '1,' + MOUSE)),
+                 (['autoconnect', 'pause'], 1, 'no auto-connect daemon reads /tmp/quill_bluetooth_autoconnect'),
+                 (['--json', 'autoconnect', 'remove', MOUSE], 0, lambda out: self.assertEqual(
+                     (out['enabled'], out['devices']), (True, []))),
+                 (['restart-daemon'], 1, 'no adapter is attached')]
+        scratch = tempfile.mkdtemp()
+        self.addCleanup(os.rmdir, scratch)
+
+        def in_private_mounts(commands):
+            commands = [c if c[0] == 'cat' else [BTBUSCTL, *c] for c in commands]
+            out = subprocess.run([IN_PRIVATE_MOUNTS, scratch, '/usr/bin/python3', '-c', RUNNER, json.dumps(commands)],
+                                 env=self.launcher.env, capture_output=True, text=True, timeout=60, check=True).stdout
+            return json.loads(out)
+        self.check(cases, in_private_mounts)
+        self.assertFalse(os.path.exists(file))
 
     def test_human_output_help_version_and_a_missing_daemon(self):
         session = dict(self.launcher.env, DBUS_SYSTEM_BUS_ADDRESS=self.launcher.env['DBUS_SESSION_BUS_ADDRESS'])
