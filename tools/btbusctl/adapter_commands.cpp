@@ -36,7 +36,10 @@ int listAdapters(const Options& options) {
              << "\n";
     }
     Output out(options);
-    out.print(options.json ? list.dump() : text.str() + "(* the default adapter)");
+    if (options.json)
+        out.print(list);
+    else
+        out.print(list.empty() ? std::string("no adapters") : text.str() + "(* the default adapter)");
     return kOk;
 }
 
