@@ -104,7 +104,13 @@ int pair(const Options& options, const std::string& address, const AgentOptions&
     if (!device) {
         if (chosen->getErrorNumber() == 2) {  // no reply: the wait was interrupted
             chosen->cancelDeviceCreation(address.c_str());
-            throw Failure("pairing with " + address + " interrupted");
+            // The cancel is sent without waiting, and may come too late: look.
+            std::unique_ptr<Device> late(chosen->findDevice(address.c_str(), false));
+            Dict props;
+            if (late) props = properties(*late);
+            const Variant* paired = lookup(props, "Paired");
+            throw Failure("pairing with " + address + " interrupted" +
+                          (paired && variantToBool(*paired) ? ", but it had completed: the device is paired" : ""));
         }
         throw failed("pairing with " + address, *chosen);
     }
