@@ -23,9 +23,10 @@ check: build
 demo: build
 	scripts/demo.sh $(BUILD)
 
-# Speed of the receiving loop against raw libdbus, measured in one run.
+# Speed of the receiving loop against raw libdbus, measured in one run; then
+# btbus-scanner's ListDevices latency and memory with up to 10,000 devices.
 bench: build
-	cd $(BUILD) && ./bench/btbus-bench-loop
+	cd $(BUILD) && taskset -c 0 ./bench/btbus-bench-loop && ./bench/btbus-bench-scanner
 
 # The tests again, built with AddressSanitizer and UndefinedBehaviorSanitizer.
 sanitize: deps

@@ -28,6 +28,8 @@
 
 #include <bluetooth/remote_object.h>
 
+#include "private_bus.h"
+
 extern char** environ;
 
 namespace {
@@ -45,40 +47,9 @@ double nowMicros() {
 
 pid_t gDaemon = -1;
 
-std::string startBus() {
-    char config[] = "btbus-bench-XXXXXX.conf";
-    int fd = mkstemps(config, 5);
-    std::string text = "<busconfig><type>session</type><listen>unix:abstract=/btbus/bench-" +
-                       std::to_string(getpid()) +
-                       "</listen><auth>EXTERNAL</auth><policy context=\"default\">"
-                       "<allow send_destination=\"*\" eavesdrop=\"true\"/><allow eavesdrop=\"true\"/>"
-                       "<allow own=\"*\"/></policy></busconfig>";
-    if (fd < 0 || write(fd, text.data(), text.size()) < 0) return "";
-    close(fd);
-    int out[2];
-    if (pipe(out) != 0) return "";
-    posix_spawn_file_actions_t actions;
-    posix_spawn_file_actions_init(&actions);
-    posix_spawn_file_actions_adddup2(&actions, out[1], 1);
-    std::string configArg = std::string("--config-file=") + config;
-    char* argv[] = { const_cast<char*>("dbus-daemon"), const_cast<char*>(configArg.c_str()),
-                     const_cast<char*>("--nofork"), const_cast<char*>("--print-address=1"), nullptr };
-    if (posix_spawnp(&gDaemon, "dbus-daemon", &actions, nullptr, argv, environ) != 0) return "";
-    close(out[1]);
-    std::string address;
-    char c;
-    while (read(out[0], &c, 1) == 1 && c != '\n') address += c;
-    close(out[0]);
-    unlink(config);
-    return address;
-}
+std::string startBus() { return btbus_bench::startBus("bench", &gDaemon); }
 
-void stopBus() {
-    if (gDaemon > 0) {
-        kill(gDaemon, SIGTERM);
-        waitpid(gDaemon, nullptr, 0);
-    }
-}
+void stopBus() { btbus_bench::stopBus(gDaemon); }
 
 DBusConnection* privateConnection() {
     DBusConnection* connection = dbus_bus_get_private(DBUS_BUS_SESSION, nullptr);

@@ -16,6 +16,9 @@
 #include <bluetooth/manager.h>
 #include <bluetooth/object_path.h>
 #include <bluetooth/remote_object.h>
+#include <bluetooth/scanner.h>
+#include <bluetooth/scanner_server.h>
+#include <bluetooth/server_object.h>
 #include <bluetooth/util.h>
 #include <bluetooth/variant.h>
 

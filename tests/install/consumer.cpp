@@ -19,6 +19,9 @@ int main() {
     Bluetooth::RemoteObject manager("org.bluez", "/", "org.bluez.Manager", DBUS_BUS_SYSTEM);
     ok = ok && manager.newMessage("DefaultAdapter") == 0 && manager.sendMessage(true, -1) == -1 &&
          manager.getErrorNumber() == 11;
+    // The scanner's client asks BlueZ first, which is not there either.
+    Bluetooth::Scanner scanner;
+    ok = ok && scanner.listDevices("hci0", false) == 0 && !scanner.removeFinder("hci0");
     std::cout << (ok ? "consumer ok" : "consumer FAILED") << std::endl;
     return ok ? 0 : 1;
 }

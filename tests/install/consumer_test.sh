@@ -10,9 +10,12 @@ here=$(cd "$(dirname "$0")" && pwd)
 
 rm -rf "$prefix"
 cmake --install "$build" --prefix "$prefix" >/dev/null
-for header in connection object_path remote_object util variant fifo auto_connect btbus; do
+for header in connection object_path remote_object util variant fifo auto_connect server_object scanner_server scanner btbus; do
     test -f "$prefix/include/bluetooth/$header.h" || { echo "missing header $header.h"; exit 1; }
 done
+test -x "$prefix/bin/btbus-scanner" || { echo "btbus-scanner was not installed"; exit 1; }
+grep -qx "Exec=.*/bin/btbus-scanner" "$prefix/share/dbus-1/services/com.quillmar.bluetooth.service" ||
+    { echo "the scanner's session service file is missing or names no daemon"; exit 1; }
 pc=$(find "$prefix" -name btbus.pc)
 test -n "$pc" || { echo "btbus.pc was not installed"; exit 1; }
 PKG_CONFIG_PATH=$(dirname "$pc")

@@ -23,6 +23,7 @@ struct Bus {
 Bus gBuses[2] = { { "system", "DBUS_SYSTEM_BUS_ADDRESS" }, { "session", "DBUS_SESSION_BUS_ADDRESS" } };
 
 // Allow-all policy: tests own any name and call anything, the agent included.
+// The session bus starts the build's services (btbus-scanner) on demand.
 std::string writeConfig(const std::string& kind) {
     std::string path = scratchDir() + "/" + kind + "-bus.conf";
     std::ofstream out(path);
@@ -32,7 +33,8 @@ std::string writeConfig(const std::string& kind) {
            "  <type>session</type>\n"
            "  <listen>unix:tmpdir=" << scratchDir() << "</listen>\n"
            "  <auth>EXTERNAL</auth>\n"
-           "  <policy context=\"default\">\n"
+        << (kind == "session" ? "  <servicedir>" BTBUS_SERVICE_DIR "</servicedir>\n" : "")
+        << "  <policy context=\"default\">\n"
            "    <allow send_destination=\"*\" eavesdrop=\"true\"/>\n"
            "    <allow eavesdrop=\"true\"/>\n"
            "    <allow own=\"*\"/>\n"
