@@ -34,6 +34,8 @@ int audio(const Options& options, const std::string& action, const std::string& 
 int volume(const Options& options, const std::string& direction, const std::string& address);
 
 int watch(const Options& options);
+// scan through the scanner service, which bus activation starts when needed.
+int sharedScan(const Options& options, int seconds);
 
 // action: show, enable, disable, add, remove, reload, pause or resume; device
 // only for add and remove.

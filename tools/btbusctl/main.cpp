@@ -62,7 +62,10 @@ int main(int argc, char** argv) {
     scanning->add_option("--timeout", seconds, "seconds to scan, 0 until Ctrl-C")
         ->check(CLI::NonNegativeNumber)
         ->capture_default_str();
-    scanning->callback([&] { run = [&] { return scan(options, seconds); }; });
+    bool shared = false;
+    scanning->add_flag("--shared", shared,
+                       "read through the scanner service on the session bus (started when not running)");
+    scanning->callback([&] { run = [&] { return shared ? sharedScan(options, seconds) : scan(options, seconds); }; });
 
     app.add_subcommand("devices", "the devices the adapter knows")
         ->callback([&] { run = [&] { return listDevices(options); }; });
