@@ -61,7 +61,8 @@ simulator() {
 
 step "Starting bluez4-sim, a simulated BlueZ 4 bluetoothd, on a private system and session bus"
 # In a session of its own, so that Ctrl-C reaches the demo, which stops it last.
-TMPDIR="$work" setsid "$top/tools/bluez4-sim/bluez4-sim" --round-seconds 0.5 >"$work/sim.env" 2>"$work/sim.err" &
+TMPDIR="$work" setsid "$top/tools/bluez4-sim/bluez4-sim" --round-seconds 0.5 \
+    --service-dir "$build/share/dbus-1/services" >"$work/sim.env" 2>"$work/sim.err" &
 sim=$!
 tries=0
 until [ "$(grep -c '^export ' "$work/sim.env" || true)" -ge 2 ]; do
@@ -112,4 +113,8 @@ else
     echo "skipped: this machine allows no private mount namespace here (unshare -m needs root)"
 fi
 
-step "Done: stopping bluez4-sim and its buses"
+step "The phone is back: the devices seen through the scanner service, started by bus activation"
+simulator SetInRange hci0 "$PHONE" true
+btbusctl scan --shared --timeout 3
+
+step "Done: stopping bluez4-sim, the scanner service and the buses"
