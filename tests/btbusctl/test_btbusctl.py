@@ -24,6 +24,8 @@ HEADSET, KEYBOARD, PHONE, MOUSE = '00:0D:3C:A1:B2:C3', '00:12:A1:B0:00:42', '5C:
 
 class BtbusctlTest(SimTestCase):
 
+    extra_args = ('--service-dir', os.environ['BTBUS_SERVICE_DIR'])  # the scanner service
+
     def btbusctl(self, *args, env=None):
         done = subprocess.run([BTBUSCTL, *args], env=env or self.launcher.env, capture_output=True,
                               text=True, timeout=30)
@@ -175,6 +177,18 @@ class BtbusctlTest(SimTestCase):
         self.assertEqual(found, sorted([HEADSET, KEYBOARD, PHONE, MOUSE]))
         self.assertEqual([e['address'] for e in events if e['event'] == 'disappeared'], [PHONE])
         self.assertFalse(self.property('Discovering'))
+
+    def test_shared_scan_reads_the_scanner_service(self):
+        scan = self.start('scan', '--shared', '--timeout', '3')
+        events = [json.loads(line) for line in scan.stdout]
+        self.assertEqual(scan.wait(10), 0)
+        # The mouse is not among them: bluetoothd holds it as a device object.
+        self.assertEqual(sorted(e['address'] for e in events if e['event'] == 'found'),
+                         sorted([HEADSET, KEYBOARD, PHONE]))
+        code, _, err = self.btbusctl('scan', '--shared', env={
+            'DBUS_SYSTEM_BUS_ADDRESS': self.launcher.env['DBUS_SYSTEM_BUS_ADDRESS']})
+        self.assertEqual((code, err), (1, 'btbusctl: the scanner service lives on the session bus, and '
+                                          'DBUS_SESSION_BUS_ADDRESS is not set\n'))
 
     def test_watch_and_agent_report_each_event_once_until_interrupted(self):
         watch = self.start('watch')
