@@ -6,7 +6,7 @@ set -eu
 
 PACKAGES="cmake make g++ pkg-config
 libdbus-1-dev dbus-daemon dbus-bin libdbus-glib-1-dev libdbus-glib-1-dev-bin libglib2.0-dev libbluetooth-dev libboost-dev
-libgtest-dev libbenchmark-dev
+libgtest-dev libbenchmark-dev libcli11-dev nlohmann-json3-dev
 python3-dbus python3-gi python3-dbusmock libglib2.0-bin util-linux systemd"
 
 missing=""

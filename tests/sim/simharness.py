@@ -6,9 +6,12 @@ calls the control interface's Reset() before each test.
 
 import os
 import re
+import shutil
 import signal
 import subprocess
+import sys
 import tempfile
+import threading
 import time
 import unittest
 
@@ -69,18 +72,26 @@ class Launcher:
     def __init__(self, *extra_args, env=None):
         scratch_dir()
         started = time.monotonic()
-        self.proc = subprocess.Popen(
-            [LAUNCHER, '--print-ready', '--round-seconds', str(ROUND_SECONDS), *extra_args],
-            stdout=subprocess.PIPE, text=True, env=env)
-        self.env = {}
-        for line in self.proc.stdout:
-            match = re.match(r'export (DBUS_\w+_BUS_ADDRESS)=(.*)$', line.strip())
-            if match:
-                self.env[match.group(1)] = match.group(2)
-            elif line.strip() == 'ready':
+        with tempfile.NamedTemporaryFile('w', suffix='.env', delete=False) as out:
+            self.env_file = out.name
+            self.proc = subprocess.Popen(
+                [LAUNCHER, '--print-ready', '--round-seconds', str(ROUND_SECONDS), *extra_args],
+                stdout=out, stderr=subprocess.PIPE, text=True, env=env)
+        for line in self.proc.stderr:
+            if line.strip() == 'ready':
                 break
+            sys.stderr.write(line)
         else:
             raise RuntimeError(f'launcher exited early ({self.proc.wait()})')
+        self.relay = threading.Thread(target=shutil.copyfileobj, args=(self.proc.stderr, sys.stderr))
+        self.relay.start()
+        self.env = {}
+        with open(self.env_file, encoding='utf-8') as f:
+            for line in f:  # the file must stay something that `.` can read
+                match = re.fullmatch(r'export (DBUS_\w+_BUS_ADDRESS)=(.*)', line.strip())
+                if not match:
+                    raise RuntimeError(f'not an export line on stdout: {line!r}')
+                self.env[match.group(1)] = match.group(2)
         self.startup_seconds = time.monotonic() - started
 
     def stop(self):
@@ -90,7 +101,9 @@ class Launcher:
         try:
             return self.proc.wait(timeout=10)
         finally:
-            self.proc.stdout.close()
+            self.relay.join(10)
+            self.proc.stderr.close()
+            os.unlink(self.env_file)
 
 
 def run_until(predicate, timeout=5.0):

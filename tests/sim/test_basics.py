@@ -4,6 +4,7 @@ import re
 import subprocess
 import time
 import unittest
+from xml.etree import ElementTree
 
 import dbus
 
@@ -101,6 +102,23 @@ class BasicsTest(SimTestCase):
         error = self.assert_error('org.freedesktop.DBus.Error.UnknownMethod', mouse, 'org.bluez.AudioSink', 'IsConnected')
         self.assertEqual(error.get_dbus_message(),
                          'Method "IsConnected" on interface "org.bluez.AudioSink" doesn\'t exist')
+
+    def test_introspection_declares_signals_with_their_argument_names(self):
+        dev = self.call(self.adapter, ADAPTER, 'CreateDevice', HEADSET)
+        cases = [('/', 'org.bluez.Manager', 'DefaultAdapterChanged', [('o', 'adapter')]),
+                 (self.adapter, ADAPTER, 'DeviceFound', [('s', 'address'), ('a{sv}', 'values')]),
+                 (self.adapter, ADAPTER, 'DeviceRemoved', [('o', 'device')]),
+                 (dev, 'org.bluez.Device', 'PropertyChanged', [('s', 'name'), ('v', 'value')]),
+                 (dev, 'org.bluez.AudioSink', 'Playing', []),
+                 (dev, 'org.bluez.Control', 'Disconnected', [])]
+        for path, iface, member, args in cases:
+            with self.subTest(member=member, iface=iface):
+                xml = ElementTree.fromstring(self.call(path, 'org.freedesktop.DBus.Introspectable', 'Introspect'))
+                signal = xml.find(f"interface[@name='{iface}']/signal[@name='{member}']")
+                self.assertIsNotNone(signal)
+                self.assertEqual([(a.get('type'), a.get('name')) for a in signal], args)
+                self.assertIsNone(xml.find(f"interface[@name='{iface}']/method[@name='{member}']"))
+        self.assert_error('org.freedesktop.DBus.Error.UnknownMethod', self.adapter, ADAPTER, 'DeviceFound')
 
     def test_add_adapter_signal_order(self):
         path = self.control('AddAdapter', 'hci1', '00:11:22:33:44:01')

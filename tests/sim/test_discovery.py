@@ -56,6 +56,28 @@ class DiscoveryTest(SimTestCase):
         self.assertFalse(self.call(self.adapter, ADAPTER, 'GetProperties')['Discovering'])
         self.assertEqual(self.adapter_events()[-1], ('Discovering', False))
 
+    def test_stop_in_a_later_round_ends_the_rounds(self):
+        """Stopped in its second round, then restarted: one round cycle, no stray Discovering."""
+        rounds = lambda: self.adapter_events().count(('Discovering', True))  # noqa: E731
+        self.call(self.adapter, ADAPTER, 'StartDiscovery')
+        self.assertTrue(run_until(lambda: rounds() >= 2, 3 * ROUND_SECONDS + 2))
+        self.call(self.adapter, ADAPTER, 'StopDiscovery')
+        self.drain(1.5 * ROUND_SECONDS)
+        stopped = self.adapter_events()
+        self.assertEqual(stopped[-1], ('Discovering', False))
+        self.assertEqual(stopped.count(('Discovering', False)), rounds())
+
+        del self.signals[:]
+        self.call(self.adapter, ADAPTER, 'StartDiscovery')
+        self.assertTrue(run_until(lambda: rounds() >= 3, 4 * ROUND_SECONDS + 2))
+        self.drain()
+        self.call(self.adapter, ADAPTER, 'StopDiscovery')
+        self.drain(1.5 * ROUND_SECONDS)
+        events = self.adapter_events()
+        one_round = [('Discovering', True), ('DeviceFound', NEAR['address']),
+                     ('DeviceFound', QUIET['address']), ('Discovering', False)]
+        self.assertEqual(events, one_round * rounds())
+
     def test_device_found_dictionary(self):
         self.call(self.adapter, ADAPTER, 'StartDiscovery')
         self.wait_signal('DeviceFound')

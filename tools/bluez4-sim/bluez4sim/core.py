@@ -49,6 +49,20 @@ ERROR_MESSAGES = {
     'Failed': 'Failed',
 }
 
+# Signals per interface with bluetoothd's argument names, for introspection.
+_PROPERTY_CHANGED = ('PropertyChanged', 'sv', ['name', 'value'])
+SIGNALS = {
+    MANAGER: [_PROPERTY_CHANGED, ('AdapterAdded', 'o', ['adapter']), ('AdapterRemoved', 'o', ['adapter']),
+              ('DefaultAdapterChanged', 'o', ['adapter'])],
+    ADAPTER: [_PROPERTY_CHANGED, ('DeviceCreated', 'o', ['device']), ('DeviceRemoved', 'o', ['device']),
+              ('DeviceFound', 'sa{sv}', ['address', 'values']), ('DeviceDisappeared', 's', ['address'])],
+    DEVICE: [_PROPERTY_CHANGED, ('DisconnectRequested', '', [])],
+    AUDIO: [_PROPERTY_CHANGED],
+    AUDIO_SINK: [_PROPERTY_CHANGED, ('Connected', '', []), ('Disconnected', '', []), ('Playing', '', []),
+                 ('Stopped', '', [])],
+    CONTROL: [_PROPERTY_CHANGED, ('Connected', '', []), ('Disconnected', '', [])],
+}
+
 # Agent request made for a pairing: local capability -> remote IO capability -> method.
 SSP_METHOD = {
     'DisplayOnly': {'KeyboardOnly': 'DisplayPasskey', 'KeyboardDisplay': 'DisplayPasskey'},
@@ -216,6 +230,8 @@ class Simulator:
         for member, in_sig, out_sig in impl.METHODS:
             table[member] = (in_sig, out_sig, '', self._dbus_entry(iface, member, in_sig, out_sig,
                                                                    getattr(impl, member), logged))
+        for member, sig, names in SIGNALS.get(iface, ()):
+            table.setdefault(member, (sig, '', '', _signal_entry(iface, member, sig, names)))
 
     def unexport_interface(self, path, iface):
         if path in mockobject.objects:
@@ -232,10 +248,7 @@ class Simulator:
         def entry(_obj, *args, _message=None, _reply=None, _error=None):
             path = _message.get_path()
             if (_message.get_signature() or '') != in_sig:
-                _error(dbus.DBusException(
-                    f'Method "{member}" with signature "{_message.get_signature() or ""}" on '
-                    f'interface "{iface}" doesn\'t exist\n',
-                    name='org.freedesktop.DBus.Error.UnknownMethod'))
+                _error(_unknown_method(iface, member, _message))
                 return
             if logged:
                 sim.log(f'{path} {iface}.{member}({format_args(args)})')
@@ -255,19 +268,7 @@ class Simulator:
             else:
                 call.ret(result)
 
-        entry.__name__ = member
-        entry._dbus_is_method = True
-        entry._dbus_is_signal = False
-        entry._dbus_interface = iface
-        entry._dbus_in_signature = in_sig
-        entry._dbus_out_signature = out_sig
-        entry._dbus_async_callbacks = ('_reply', '_error')
-        entry._dbus_message_keyword = '_message'
-        for kw in ('sender', 'path', 'rel_path', 'destination', 'connection'):
-            setattr(entry, f'_dbus_{kw}_keyword', None)
-        entry._dbus_args = [f'arg{i}' for i in range(len(dbus.Signature(in_sig)))]
-        entry._dbus_get_args_options = {'byte_arrays': False}
-        return entry
+        return _callable_entry(entry, iface, member, in_sig, out_sig)
 
     def emit(self, path, iface, member, sig='', *args):
         msg = dbus.lowlevel.SignalMessage(path, iface, member)
@@ -371,6 +372,43 @@ class Simulator:
         if name.startswith(':') and not new_owner:
             for adapter in list(self.adapters.values()):
                 adapter.client_gone(name)
+
+
+def _unknown_method(iface, member, message):
+    return dbus.DBusException(
+        f'Method "{member}" with signature "{message.get_signature() or ""}" on '
+        f'interface "{iface}" doesn\'t exist\n', name='org.freedesktop.DBus.Error.UnknownMethod')
+
+
+def _callable_entry(entry, iface, member, in_sig, out_sig):
+    """Give `entry` the attributes dbus-python reads to call it and to introspect it."""
+    entry.__name__ = member
+    entry._dbus_is_method = True
+    entry._dbus_is_signal = False
+    entry._dbus_interface = iface
+    entry._dbus_in_signature = in_sig
+    entry._dbus_out_signature = out_sig
+    entry._dbus_async_callbacks = ('_reply', '_error')
+    entry._dbus_message_keyword = '_message'
+    for kw in ('sender', 'path', 'rel_path', 'destination', 'connection'):
+        setattr(entry, f'_dbus_{kw}_keyword', None)
+    entry._dbus_args = [f'arg{i}' for i in range(len(dbus.Signature(in_sig)))]
+    entry._dbus_get_args_options = {'byte_arrays': False}
+    return entry
+
+
+def _signal_entry(iface, member, sig, names):
+    """A signal declaration in the object's table: introspected as a signal, and
+    called as a method (which bluetoothd does not offer) it answers UnknownMethod."""
+    def entry(_obj, *_args, _message=None, _reply=None, _error=None):
+        _error(_unknown_method(iface, member, _message))
+
+    entry = _callable_entry(entry, iface, member, sig, '')
+    entry._dbus_is_method = False
+    entry._dbus_is_signal = True
+    entry._dbus_signature = sig
+    entry._dbus_args = names
+    return entry
 
 
 def mock_pid():
@@ -566,7 +604,9 @@ class Adapter:
             for address in sorted(self.found_before - self.found_now):
                 self.sim.emit(self.path, ADAPTER, 'DeviceDisappeared', 's', address)
         self.found_before = self.found_now
-        self.round_timer = self._start_round() if self.discovery else None
+        self.round_timer = None
+        if self.discovery:
+            self._start_round()  # arms the next round's timer itself
 
     def report_found(self, dev):
         """DeviceFound for a device answering the inquiry of the running round."""
