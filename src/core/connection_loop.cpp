@@ -37,10 +37,14 @@ const int kBackOffMs = 2;
 // Queued signals with no receiving thread to run them: the oldest go first.
 const size_t kMaxQueued = 100000;
 
+}  // namespace
+
 const char kNoReplyText[] =
     "Did not receive a reply. Possible causes include: the remote application did not send a "
     "reply, the message bus security policy blocked the reply, the reply timeout expired, or the "
     "network connection was broken.";
+
+namespace {
 
 std::atomic<int> gStop(0);
 

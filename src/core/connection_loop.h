@@ -110,6 +110,9 @@ private:
     bool overflowLogged_;
 };
 
+// What a call that got no reply in time reads, as libdbus words it.
+extern const char kNoReplyText[];
+
 // Marks what a callback uses (an object, an Agent), so that its destruction on
 // another thread waits for the callback to return. A thread never waits for
 // its own uses: a handler may destroy its own proxy.

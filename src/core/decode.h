@@ -14,6 +14,9 @@ namespace internal {
 // signals. Each returns 0, or the error number its failure sets (4); none
 // advances the iterator.
 
+// The type of the iterator's current argument.
+inline int typeOf(DBusMessageIter& iterator) { return dbus_message_iter_get_arg_type(&iterator); }
+
 // The text of a STRING, OBJECT_PATH or SIGNATURE argument.
 inline const char* readText(DBusMessageIter& iterator) {
     const char* text = "";

@@ -27,8 +27,6 @@ void installInterruptHandlers() {
     sigaction(SIGINT, &action, 0);
 }
 
-const char kNoReplyText[] = "Did not receive a reply: the time-out expired before the peer answered";
-
 }  // namespace
 
 int RemoteObject::sendMessagePending() {
@@ -57,7 +55,7 @@ int RemoteObject::sendMessagePending() {
             // A time-out reads as the error reply libdbus would have made; an
             // interrupt leaves no reply (error 2 when it is read).
             if (end == internal::ConnectionLoop::kTimedOut)
-                setReplyMessage(dbus_message_new_error(message, DBUS_ERROR_NO_REPLY, kNoReplyText));
+                setReplyMessage(dbus_message_new_error(message, DBUS_ERROR_NO_REPLY, internal::kNoReplyText));
         }
         dbus_pending_call_unref(pending);
     }

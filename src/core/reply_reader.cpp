@@ -11,8 +11,6 @@ namespace internal {
 
 namespace {
 
-int typeOf(DBusMessageIter& iterator) { return dbus_message_iter_get_arg_type(&iterator); }
-
 bool isText(int type) {
     return type == DBUS_TYPE_STRING || type == DBUS_TYPE_OBJECT_PATH || type == DBUS_TYPE_SIGNATURE;
 }
@@ -143,8 +141,9 @@ EntriesResult decodeEntries(DBusMessageIter& array, Dict& dict) {
 using internal::MessagePtr;
 using internal::readText;
 
+using internal::typeOf;
+
 namespace {
-int typeOf(DBusMessageIter& iterator) { return dbus_message_iter_get_arg_type(&iterator); }
 const int kBusError = 11;
 }  // namespace
 

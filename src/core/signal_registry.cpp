@@ -24,6 +24,7 @@ namespace {
 
 using internal::ScopedError;
 using internal::readText;
+using internal::typeOf;
 
 // Guards the five lists. Never held across a call to the bus or a handler.
 std::mutex gListsLock;
@@ -31,8 +32,6 @@ std::mutex gListsLock;
 // before a call is still listed.
 unsigned long gUnlinks = 0;
 unsigned long gRegistrations = 0;
-
-int typeOf(DBusMessageIter& iterator) { return dbus_message_iter_get_arg_type(&iterator); }
 
 template <typename F>
 bool stillListed(const std::list<SignalHandler<F> >& list, unsigned long registration) {
