@@ -26,8 +26,14 @@ namespace {
 // libdbus's own default for a time-out of -1.
 const int kDefaultTimeoutMs = 25000;
 // How long the pump may stay free, every receiving thread busy in a handler,
-// before a waiting thread reads the socket itself.
+// before a waiting thread reads the socket and dispatches itself.
 const int kTakeOverMs = 20;
+// How long a thread waiting for a reply beside a receiving thread reads the
+// socket itself (most replies come sooner)...
+const int kYoungMs = 5;
+// ... and how long after such a read receiving threads leave the socket to the
+// next call, at most the delay it adds to a signal.
+const int kHandBackMs = 1;
 // The longest a waiting thread reads the socket before it looks again whether
 // its wait has ended (an interrupt, a receiving thread back from its handler).
 const int kSliceMs = 50;
@@ -56,6 +62,8 @@ thread_local ConnectionLoop* tReceiving = 0;
 // Whether this thread is inside libdbus's dispatch (an object path of other
 // code than the Agent's is called there): a wait there could never end.
 thread_local bool tInDispatch = false;
+// The loop whose socket this thread reads at the moment.
+thread_local const ConnectionLoop* tPumping = 0;
 
 const char kInDispatchText[] =
     "A reply cannot be waited for inside libdbus's dispatch (an object path's own handler)";
@@ -85,9 +93,8 @@ std::multimap<const void*, ConnectionLoop*> gStarting;
 }  // namespace
 
 struct ConnectionLoop::Waiter {
-    std::mutex* lock;
-    std::condition_variable* changed;
-    bool done;
+    ConnectionLoop* loop;
+    bool done;  // guarded by the loop's lock
     std::atomic<int> references;
 };
 
@@ -159,8 +166,14 @@ void waitUnused(const void* key) {
 ConnectionLoop::ConnectionLoop(DBusConnection* connection)
     : connection_(connection),
       pumping_(false),
+      receiverPumping_(false),
+      readerWaiter_(0),
       pumpFreeSince_(Clock::now()),
+      youngCallers_(0),
+      handBackAt_(),
+      dispatchWanted_(false),
       runningWork_(false),
+      workSince_(),
       receivers_(0),
       overflowLogged_(false) {
     if (pipe2(wake_, O_NONBLOCK | O_CLOEXEC) != 0) {
@@ -190,8 +203,10 @@ void ConnectionLoop::wake() {
     (void)written;  // a full pipe wakes the poll all the same
 }
 
+// The thread that reads the socket looks at the queue anyway when it is done.
 void ConnectionLoop::onDispatchStatus(DBusConnection*, DBusDispatchStatus status, void* data) {
-    if (status == DBUS_DISPATCH_DATA_REMAINS) static_cast<ConnectionLoop*>(data)->wake();
+    ConnectionLoop* loop = static_cast<ConnectionLoop*>(data);
+    if (status == DBUS_DISPATCH_DATA_REMAINS && tPumping != loop) loop->wake();
 }
 
 void ConnectionLoop::queue(const Work& work) {
@@ -236,32 +251,52 @@ void ConnectionLoop::dispatchAll() {
 
 const char* ConnectionLoop::cannotWait() { return tInDispatch ? kInDispatchText : 0; }
 
-void ConnectionLoop::pump(int milliseconds) {
-    if (dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_DATA_REMAINS) {
-        dispatchAll();
-        return;
+DBusMessage* ConnectionLoop::takeReply(dbus_uint32_t serial) {
+    DBusMessage* head = dbus_connection_borrow_message(connection_);
+    if (head == 0) return 0;
+    int type = dbus_message_get_type(head);
+    if ((type == DBUS_MESSAGE_TYPE_METHOD_RETURN || type == DBUS_MESSAGE_TYPE_ERROR) &&
+        dbus_message_get_reply_serial(head) == serial) {
+        dbus_connection_steal_borrowed_message(connection_, head);
+        return head;
     }
-    if (!dbus_connection_get_is_connected(connection_)) {
-        // Nothing more will come: the wait is the caller's time-out.
-        bool ignored;
-        pollFor(connection_, wake_[0], milliseconds < 0 ? 100 : std::min(milliseconds, 100), ignored);
-        dispatchAll();  // the local Disconnected signal, failed pending calls
-        return;
-    }
-    bool socketReady = false;
-    if (pollFor(connection_, wake_[0], milliseconds, socketReady) < 0 && errno != EINTR)
-        usleep(kBackOffMs * 1000);
-    if (socketReady) {
-        dbus_connection_read_write(connection_, 0);
-        // The socket was ready, yet nothing came of it: another thread holds
-        // libdbus's I/O path (a flush) and will read it.
-        if (dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_COMPLETE) {
+    dbus_connection_return_message(connection_, head);
+    return 0;
+}
+
+DBusMessage* ConnectionLoop::pump(int milliseconds, dbus_uint32_t serial, bool dispatch) {
+    tPumping = this;
+    DBusMessage* mine = serial != 0 ? takeReply(serial) : 0;
+    if (mine == 0) {
+        if (dispatch && dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_DATA_REMAINS) {
+            // Queued by another thread's I/O: nothing to read first.
+        } else if (!dbus_connection_get_is_connected(connection_)) {
+            // Nothing more will come: the wait is the caller's time-out.
             bool ignored;
-            pollFor(connection_, -1, 0, ignored);
-            usleep(kBackOffMs * 1000);
+            pollFor(connection_, wake_[0], milliseconds < 0 ? 100 : std::min(milliseconds, 100),
+                    ignored);
+        } else {
+            bool socketReady = false;
+            if (pollFor(connection_, wake_[0], milliseconds, socketReady) < 0 && errno != EINTR)
+                usleep(kBackOffMs * 1000);
+            if (socketReady) {
+                dbus_connection_read_write(connection_, 0);
+                // The socket was ready, yet nothing came of it: another thread
+                // holds libdbus's I/O path (a flush) and will read it.
+                if (dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_COMPLETE) {
+                    bool ignored;
+                    pollFor(connection_, -1, 0, ignored);
+                    usleep(kBackOffMs * 1000);
+                }
+            }
+            if (serial != 0) mine = takeReply(serial);
         }
     }
-    dispatchAll();
+    // Also the local Disconnected signal and failed pending calls of a closed
+    // connection.
+    if (dispatch) dispatchAll();
+    tPumping = 0;
+    return mine;
 }
 
 bool ConnectionLoop::mayPump(bool receiving, Clock::time_point now) const {
@@ -269,6 +304,12 @@ bool ConnectionLoop::mayPump(bool receiving, Clock::time_point now) const {
     if (receiving || receivers_ == 0 || stopped()) return true;
     // A receiving thread reads the socket as soon as it is free of handlers.
     return now - pumpFreeSince_ >= std::chrono::milliseconds(kTakeOverMs);
+}
+
+bool ConnectionLoop::mayDispatch(bool receiving, Clock::time_point now) const {
+    if (receiving || receivers_ == 0 || stopped()) return true;
+    // Every receiving thread is busy in a handler.
+    return runningWork_ && receivers_ == 1 && now - workSince_ >= std::chrono::milliseconds(kTakeOverMs);
 }
 
 bool ConnectionLoop::takeWork(bool methodCallsOnly, Work& work) {
@@ -347,6 +388,7 @@ void ConnectionLoop::receive() {
         Work work;
         if (!runningWork_ && takeWork(false, work)) {
             runningWork_ = true;
+            workSince_ = Clock::now();
             if (work.function != 0) beginUse(work.data);  // before the lock goes: see forgetMethodCalls
             hold.unlock();
             runWork(work);
@@ -355,17 +397,29 @@ void ConnectionLoop::receive() {
             changed_.notify_all();
             continue;
         }
-        if (mayPump(true, Clock::now())) {
-            pumping_ = true;
+        if (dispatchWanted_) {
+            dispatchWanted_ = false;
             hold.unlock();
-            pump(dbus_connection_get_is_connected(connection_) ? -1 : 100);
+            dispatchAll();
             hold.lock();
-            pumping_ = false;
+            continue;
+        }
+        Clock::time_point now = Clock::now();
+        bool callersRead = youngCallers_ > 0 || now < handBackAt_;
+        if (!pumping_ && !callersRead) {
+            pumping_ = receiverPumping_ = true;
+            hold.unlock();
+            pump(dbus_connection_get_is_connected(connection_) ? -1 : 100, 0, true);
+            hold.lock();
+            pumping_ = receiverPumping_ = false;
             pumpFreeSince_ = Clock::now();
             changed_.notify_all();
             continue;
         }
-        changed_.wait(hold);
+        if (callersRead)
+            changed_.wait_until(hold, std::max(handBackAt_, now + std::chrono::milliseconds(kHandBackMs)));
+        else
+            changed_.wait(hold);
     }
     --receivers_;
     changed_.notify_all();
@@ -375,52 +429,94 @@ void ConnectionLoop::receive() {
 
 void ConnectionLoop::onCompleted(DBusPendingCall*, void* data) {
     Waiter* waiter = static_cast<Waiter*>(data);
+    ConnectionLoop* loop = waiter->loop;
+    bool polling;
     {
-        std::lock_guard<std::mutex> hold(*waiter->lock);
+        std::lock_guard<std::mutex> hold(loop->lock_);
         waiter->done = true;
+        polling = loop->readerWaiter_ == waiter && tPumping != loop;
     }
-    waiter->changed->notify_all();
+    loop->changed_.notify_all();
+    if (polling) loop->wake();  // the waiting thread polls the socket
     // Orders this call before the waiter's release for ThreadSanitizer, which
     // cannot see libdbus's own reference count.
     waiter->references.fetch_add(0, std::memory_order_release);
 }
 
-ConnectionLoop::End ConnectionLoop::wait(DBusPendingCall* pending, int timeout, bool runMethodCalls,
-                                         const std::atomic<int>* interrupted) {
+ConnectionLoop::End ConnectionLoop::wait(DBusPendingCall* pending, dbus_uint32_t serial, int timeout,
+                                         bool runMethodCalls, const std::atomic<int>* interrupted,
+                                         DBusMessage** reply) {
     Waiter* waiter = new Waiter;
-    waiter->lock = &lock_;
-    waiter->changed = &changed_;
+    waiter->loop = this;
     waiter->done = false;
     waiter->references = 2;
     if (!dbus_pending_call_set_notify(pending, &onCompleted, waiter, &releaseWaiter))
         releaseWaiter(waiter);  // libdbus holds none
-    End end = waitFor(pending, waiter, timeout, runMethodCalls, interrupted);
+    DBusMessage* taken = 0;
+    End end = waitFor(pending, waiter, serial, timeout, runMethodCalls, interrupted, &taken);
     releaseWaiter(waiter);
+    *reply = 0;
+    if (taken != 0) {
+        dbus_pending_call_cancel(pending);  // its reply was taken off the queue
+        *reply = taken;
+    } else if (end == kReplied) {
+        *reply = dbus_pending_call_steal_reply(pending);
+    }
     return end;
 }
 
-ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, const Waiter* waiter, int timeout,
-                                            bool runMethodCalls, const std::atomic<int>* interrupted) {
+ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, Waiter* waiter, dbus_uint32_t serial,
+                                            int timeout, bool runMethodCalls,
+                                            const std::atomic<int>* interrupted, DBusMessage** taken) {
+    using std::chrono::milliseconds;
     bool endless = timeout == DBUS_TIMEOUT_INFINITE;
-    Clock::time_point deadline =
-        Clock::now() + std::chrono::milliseconds(timeout < 0 ? kDefaultTimeoutMs : timeout);
+    Clock::time_point start = Clock::now();
+    Clock::time_point deadline = start + milliseconds(timeout < 0 ? kDefaultTimeoutMs : timeout);
+    Clock::time_point youngUntil = start + milliseconds(kYoungMs);
     bool receiving = tReceiving == this;
 
     std::unique_lock<std::mutex> hold(lock_);
+    // Beside a receiving thread, read the socket for the first moments of the
+    // wait, leaving what is not this reply to be dispatched by that thread.
+    bool young = !receiving && receivers_ > 0 && !stopped();
+    if (young) ++youngCallers_;
+    bool askedForSocket = false;
+    End end;
     for (;;) {
         // Also asked of the call: it may have completed before the notify was set.
-        if (waiter->done) return kReplied;
+        if (waiter->done) {
+            end = kReplied;
+            break;
+        }
         hold.unlock();
         bool completed = dbus_pending_call_get_completed(pending);
         hold.lock();
-        if (completed) return kReplied;
-        if (!dbus_connection_get_is_connected(connection_)) return kClosed;
-        if (interrupted != 0 && interrupted->load() != 0) return kInterrupted;
+        if (completed) {
+            end = kReplied;
+            break;
+        }
+        if (!dbus_connection_get_is_connected(connection_)) {
+            end = kClosed;
+            break;
+        }
+        if (interrupted != 0 && interrupted->load() != 0) {
+            end = kInterrupted;
+            break;
+        }
         Clock::time_point now = Clock::now();
-        if (!endless && now >= deadline) return kTimedOut;
+        if (!endless && now >= deadline) {
+            end = kTimedOut;
+            break;
+        }
         int left = endless ? kSliceMs
-                           : static_cast<int>(std::chrono::duration_cast<std::chrono::milliseconds>(
-                                                  deadline - now).count()) + 1;
+                           : static_cast<int>(std::chrono::duration_cast<milliseconds>(deadline - now).count()) + 1;
+        if (young && (now >= youngUntil || receivers_ == 0 || stopped())) {
+            // A slow reply: the receiving threads read it.
+            young = false;
+            --youngCallers_;
+            handBackAt_ = now;
+            changed_.notify_all();
+        }
         Work work;
         if (runMethodCalls && takeWork(true, work)) {
             beginUse(work.data);
@@ -429,18 +525,51 @@ ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, const Wait
             hold.lock();
             continue;
         }
-        if (mayPump(receiving, now)) {
-            pumping_ = true;
+        if (dispatchWanted_ && mayDispatch(receiving, now)) {
+            dispatchWanted_ = false;
             hold.unlock();
-            pump(std::min(left, kSliceMs));
+            dispatchAll();
             hold.lock();
-            pumping_ = false;
-            pumpFreeSince_ = Clock::now();
-            changed_.notify_all();
             continue;
         }
-        changed_.wait_for(hold, std::chrono::milliseconds(std::min(left, kTakeOverMs)));
+        if (!pumping_ && (young || mayPump(receiving, now))) {
+            int slice = std::min(left, young ? static_cast<int>(std::chrono::duration_cast<milliseconds>(
+                                                                    youngUntil - now).count()) + 1
+                                             : kSliceMs);
+            pumping_ = true;
+            readerWaiter_ = waiter;
+            hold.unlock();
+            DBusMessage* mine = pump(slice, serial, !young);
+            bool remains = young && dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_DATA_REMAINS;
+            hold.lock();
+            pumping_ = false;
+            readerWaiter_ = 0;
+            pumpFreeSince_ = Clock::now();
+            if (young) handBackAt_ = pumpFreeSince_ + milliseconds(kHandBackMs);
+            if (remains) dispatchWanted_ = true;
+            // Others wait for the socket or for what was read; a quick call
+            // alone wakes nobody.
+            if (!young || remains || youngCallers_ > 1) changed_.notify_all();
+            if (mine != 0) {
+                *taken = mine;
+                end = kReplied;
+                break;
+            }
+            continue;
+        }
+        if (young && receiverPumping_ && !askedForSocket) {
+            askedForSocket = true;  // the receiving thread leaves the socket when woken
+            hold.unlock();
+            wake();
+            hold.lock();
+            continue;
+        }
+        Clock::time_point until = now + milliseconds(std::min(left, kTakeOverMs));
+        if (young) until = std::min(until, youngUntil);
+        changed_.wait_until(hold, until);
     }
+    if (young) --youngCallers_;
+    return end;
 }
 
 DBusMessage* ConnectionLoop::call(DBusMessage* message, int timeout, DBusError* error) {
@@ -454,11 +583,9 @@ DBusMessage* ConnectionLoop::call(DBusMessage* message, int timeout, DBusError* 
         return 0;
     }
     dbus_connection_flush(connection_);
-    End end = wait(pending, timeout, false, 0);
     DBusMessage* reply = 0;
-    if (end == kReplied) {
-        reply = dbus_pending_call_steal_reply(pending);
-    } else {
+    End end = wait(pending, dbus_message_get_serial(message), timeout, false, 0, &reply);
+    if (end != kReplied) {
         dbus_pending_call_cancel(pending);  // a late reply is dropped
         if (end == kClosed)
             dbus_set_error_const(error, DBUS_ERROR_DISCONNECTED, "Connection is closed");

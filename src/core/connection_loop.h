@@ -37,11 +37,13 @@ public:
     // Sends message and waits for its reply; a D-Bus error, a time-out or a
     // closed connection gives null with error set. timeout as libdbus takes it.
     DBusMessage* call(DBusMessage* message, int timeout, DBusError* error);
-    // Waits for pending to complete, at most timeout (libdbus's meaning), or
-    // until *interrupted is set. runMethodCalls: answer deferred method calls
-    // (the Agent's) meanwhile on this thread.
-    End wait(DBusPendingCall* pending, int timeout, bool runMethodCalls,
-             const std::atomic<int>* interrupted);
+    // Waits for the reply to pending (the call of serial), at most timeout
+    // (libdbus's meaning), or until *interrupted is set. On kReplied, *reply is
+    // the reply (owned by the caller; null if libdbus kept none); on any other
+    // end the call is left to the caller to cancel. runMethodCalls: answer
+    // deferred method calls (the Agent's) meanwhile on this thread.
+    End wait(DBusPendingCall* pending, dbus_uint32_t serial, int timeout, bool runMethodCalls,
+             const std::atomic<int>* interrupted, DBusMessage** reply);
 
     // Why this thread cannot wait for a reply now (it is inside libdbus's
     // dispatch), or null.
@@ -81,8 +83,11 @@ private:
     explicit ConnectionLoop(DBusConnection* connection);
 
     // Reads what the socket holds (waiting up to milliseconds, -1 without end)
-    // and dispatches it; runs with pumping_ set by the caller.
-    void pump(int milliseconds);
+    // and, if dispatch, dispatches it; runs with pumping_ set by the caller.
+    // Returns the reply to serial (not 0) when it heads the incoming queue.
+    DBusMessage* pump(int milliseconds, dbus_uint32_t serial, bool dispatch);
+    // Takes the reply to serial off the incoming queue if it comes first.
+    DBusMessage* takeReply(dbus_uint32_t serial);
     void dispatchAll();
     void runWork(Work& work);
     // Pops the first work item that may run on this thread; false if none.
@@ -90,8 +95,9 @@ private:
     void queue(const Work& work);
     void wake();
     bool mayPump(bool receiving, Clock::time_point now) const;
-    End waitFor(DBusPendingCall* pending, const Waiter* waiter, int timeout, bool runMethodCalls,
-                const std::atomic<int>* interrupted);
+    bool mayDispatch(bool receiving, Clock::time_point now) const;
+    End waitFor(DBusPendingCall* pending, Waiter* waiter, dbus_uint32_t serial, int timeout,
+                bool runMethodCalls, const std::atomic<int>* interrupted, DBusMessage** taken);
 
     static DBusHandlerResult filter(DBusConnection*, DBusMessage* message, void* data);
     static void onDispatchStatus(DBusConnection*, DBusDispatchStatus status, void* data);
@@ -102,9 +108,18 @@ private:
 
     std::mutex lock_;  // guards what follows
     std::condition_variable changed_;  // a reply arrived, work queued, the pump freed, a stop
-    bool pumping_;                     // a thread reads and dispatches the connection
+    bool pumping_;                     // a thread reads the connection
+    bool receiverPumping_;             // ... and it is a receiving thread
+    const Waiter* readerWaiter_;       // ... or it waits for this reply
     Clock::time_point pumpFreeSince_;
+    // Threads that began waiting for a reply beside a receiving thread a moment
+    // ago read the socket themselves, so that a quick reply wakes one thread,
+    // not two; receiving threads leave the socket to them until handBackAt_.
+    int youngCallers_;
+    Clock::time_point handBackAt_;
+    bool dispatchWanted_;              // a waiting thread read what a receiving thread dispatches
     bool runningWork_;                 // a receiving thread runs work
+    Clock::time_point workSince_;
     std::deque<Work> work_;
     int receivers_;
     bool overflowLogged_;

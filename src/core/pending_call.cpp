@@ -45,11 +45,12 @@ int RemoteObject::sendMessagePending() {
         installInterruptHandlers();
         // Any thread may wait here, a handler on a receiving thread included:
         // the Agent's requests are answered meanwhile on this thread.
-        internal::ConnectionLoop::End end =
-            internal::ConnectionLoop::of(connection)->wait(pending, -1, true, &gInterrupted);
+        DBusMessage* answer = 0;
+        internal::ConnectionLoop::End end = internal::ConnectionLoop::of(connection)->wait(
+            pending, dbus_message_get_serial(message), -1, true, &gInterrupted, &answer);
         if (end == internal::ConnectionLoop::kReplied) {
             gReplyArrived = 1;
-            setReplyMessage(dbus_pending_call_steal_reply(pending));  // none gives error 2
+            setReplyMessage(answer);  // none gives error 2
         } else {
             dbus_pending_call_cancel(pending);  // no reply can arrive for it later
             // A time-out reads as the error reply libdbus would have made; an

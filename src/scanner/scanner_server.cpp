@@ -53,21 +53,35 @@ struct ScannerServer::Service {
         return bluez.findAdapter(name);
     }
 
+    // A ListDevices and a DeviceFound may create the same finder at once: the
+    // first claims its set before the bus calls, so discovery starts once.
+    // The set returned only tells whether there is one; read it under the lock.
     static AddressSet* addFinder(ScannerObject& object, ScannerServer& server, const char* name) {
+        AddressSet* claimed = 0;
+        {
+            Hold hold(server.stateLock);
+            if (AddressSet* set = finderLocked(object, name)) return set;
+            claimed = new AddressSet;
+            (*object.finders)[name] = claimed;
+        }
         Adapter* adapter = findAdapter(server, name);
-        if (adapter == 0) return 0;
-        adapter->startDiscovery();
-        adapter->setDeviceFoundHandler(&scannerDeviceFound);
-        adapter->setDeviceDisappearedHandler(&scannerDeviceDisappeared);
-        std::unique_ptr<AddressSet> created(new AddressSet);
+        if (adapter != 0) {
+            adapter->startDiscovery();
+            adapter->setDeviceFoundHandler(&scannerDeviceFound);
+            adapter->setDeviceDisappearedHandler(&scannerDeviceDisappeared);
+        }
         Hold hold(server.stateLock);
+        if (adapter == 0) {
+            FinderTable::iterator found = object.finders->find(name);
+            if (found != object.finders->end() && found->second == claimed) {
+                object.finders->erase(found);
+                delete claimed;
+            }
+            return 0;
+        }
         server.founders->push_back(adapter);
         server.countdown = kIdleTicks;
-        // Another thread may have created the finder meanwhile: keep its set.
-        std::pair<FinderTable::iterator, bool> slot =
-            object.finders->insert(FinderTable::value_type(name, created.get()));
-        if (slot.second) created.release();
-        return slot.first->second;
+        return finderLocked(object, name);
     }
 
     static AddressSet* finderLocked(ScannerObject& object, const std::string& name) {
