@@ -27,6 +27,7 @@ demo: build
 # btbus-scanner's ListDevices latency and memory with up to 10,000 devices.
 bench: build
 	cd $(BUILD) && taskset -c 0 ./bench/btbus-bench-loop && ./bench/btbus-bench-scanner
+	$(CURDIR)/bench/decode_instructions.sh $(BUILD)/bench/btbus-bench-loop $(BUILD)/bench
 
 # The tests again, built with AddressSanitizer and UndefinedBehaviorSanitizer.
 sanitize: deps

@@ -5,7 +5,9 @@
 //     the same calls made with raw libdbus and no loop at all.
 //  3. decoding a 12-entry GetProperties reply into a Dict, as a ratio to a raw
 //     iterator walk that reads every value;
-//  4. how often an idle receiving thread wakes up.
+//  4. how often an idle receiving thread wakes up;
+//  5. one-way calls, and receiving 100,000 DeviceFound-like signals, each as a
+//     ratio to raw libdbus.
 // Run it pinned to one CPU (make bench does) for steady ratios.
 // Usage: btbus-bench-loop [signals] [calls]
 #include <algorithm>
@@ -177,6 +179,26 @@ double rawCalls(DBusConnection* connection, int count) {
 
 // ---- decoding ----
 
+// Appends one {sv} entry to an open dictionary; an array's value is a
+// null-ended list of texts.
+void appendEntry(DBusMessageIter& dict, const char* name, int type, const char* signature, const void* value) {
+    DBusMessageIter e, v;
+    dbus_message_iter_open_container(&dict, DBUS_TYPE_DICT_ENTRY, nullptr, &e);
+    dbus_message_iter_append_basic(&e, DBUS_TYPE_STRING, &name);
+    dbus_message_iter_open_container(&e, DBUS_TYPE_VARIANT, signature, &v);
+    if (type == DBUS_TYPE_ARRAY) {
+        DBusMessageIter a;
+        dbus_message_iter_open_container(&v, DBUS_TYPE_ARRAY, signature + 1, &a);
+        for (const char* const* item = static_cast<const char* const*>(value); *item; ++item)
+            dbus_message_iter_append_basic(&a, signature[1], item);
+        dbus_message_iter_close_container(&v, &a);
+    } else {
+        dbus_message_iter_append_basic(&v, type, value);
+    }
+    dbus_message_iter_close_container(&e, &v);
+    dbus_message_iter_close_container(&dict, &e);
+}
+
 // An adapter's GetProperties reply as BlueZ sends it: 12 entries.
 DBusMessage* propertiesReply() {
     DBusMessage* call = dbus_message_new_method_call("org.bluez", "/org/bluez/1/hci0", "org.bluez.Adapter",
@@ -188,21 +210,7 @@ DBusMessage* propertiesReply() {
     dbus_message_iter_init_append(reply, &args);
     dbus_message_iter_open_container(&args, DBUS_TYPE_ARRAY, "{sv}", &dict);
     auto entry = [&](const char* name, int type, const char* signature, const void* value) {
-        DBusMessageIter e, v;
-        dbus_message_iter_open_container(&dict, DBUS_TYPE_DICT_ENTRY, nullptr, &e);
-        dbus_message_iter_append_basic(&e, DBUS_TYPE_STRING, &name);
-        dbus_message_iter_open_container(&e, DBUS_TYPE_VARIANT, signature, &v);
-        if (type == DBUS_TYPE_ARRAY) {
-            DBusMessageIter a;
-            dbus_message_iter_open_container(&v, DBUS_TYPE_ARRAY, signature + 1, &a);
-            for (const char* const* item = static_cast<const char* const*>(value); *item; ++item)
-                dbus_message_iter_append_basic(&a, signature[1], item);
-            dbus_message_iter_close_container(&v, &a);
-        } else {
-            dbus_message_iter_append_basic(&v, type, value);
-        }
-        dbus_message_iter_close_container(&e, &v);
-        dbus_message_iter_close_container(&dict, &e);
+        appendEntry(dict, name, type, signature, value);
     };
     const char* address = "00:11:22:33:44:55";
     const char* name = "kitchen-nas";
@@ -230,7 +238,7 @@ DBusMessage* propertiesReply() {
 }
 
 // Reads every value of the reply with libdbus's iterator and nothing else.
-size_t rawWalk(DBusMessage* reply) {
+__attribute__((noinline)) size_t rawWalk(DBusMessage* reply) {
     size_t seen = 0;
     DBusMessageIter args, dict;
     dbus_message_iter_init(reply, &args);
@@ -260,6 +268,14 @@ size_t rawWalk(DBusMessage* reply) {
     return seen;
 }
 
+// The library's decoding of the reply into a Dict, as a proxy's caller meets it.
+__attribute__((noinline)) size_t libraryDecode(Bluetooth::RemoteObject& reader, DBusMessage* reply) {
+    Bluetooth::Dict dict;
+    reader.setReplyMessage(dbus_message_ref(reply));
+    if (reader.getReplyValue(dict) != 0 || dict.size() != 12) std::exit(1);
+    return dict.size();
+}
+
 // Decoding time of the library over the raw walk, median of rounds.
 double decodeRatio(int rounds, int count) {
     DBusMessage* reply = propertiesReply();
@@ -271,17 +287,123 @@ double decodeRatio(int rounds, int count) {
         for (int i = 0; i < count; ++i) sink += rawWalk(reply);
         double raw = std::chrono::duration<double>(Clock::now() - start).count();
         start = Clock::now();
-        for (int i = 0; i < count; ++i) {
-            Bluetooth::Dict dict;
-            reader.setReplyMessage(dbus_message_ref(reply));
-            if (reader.getReplyValue(dict) != 0 || dict.size() != 12) std::exit(1);
-            sink += dict.size();
-        }
+        for (int i = 0; i < count; ++i) sink += libraryDecode(reader, reply);
         ratios.push_back(std::chrono::duration<double>(Clock::now() - start).count() / raw);
     }
     dbus_message_unref(reply);
     std::sort(ratios.begin(), ratios.end());
     return sink != 0 ? ratios[ratios.size() / 2] : 0;
+}
+
+// ---- one-way calls and a storm of signals ----
+
+double libraryOneWay(Bluetooth::RemoteObject& caller, int count) {
+    auto start = Clock::now();
+    for (int i = 0; i < count; ++i)
+        if (caller.newMessage("Echo") != 0 || caller.sendMessage(false, -1) != 0) std::exit(1);
+    return std::chrono::duration<double>(Clock::now() - start).count();
+}
+
+double rawOneWay(DBusConnection* connection, int count) {
+    auto start = Clock::now();
+    for (int i = 0; i < count; ++i) {
+        DBusMessage* call = dbus_message_new_method_call(kService, kPath, kInterface, "Echo");
+        dbus_message_set_no_reply(call, TRUE);
+        if (!dbus_connection_send(connection, call, nullptr)) std::exit(1);
+        dbus_connection_flush(connection);
+        dbus_message_unref(call);
+    }
+    return std::chrono::duration<double>(Clock::now() - start).count();
+}
+
+// A DeviceFound of BlueZ: an address and five properties.
+DBusMessage* foundSignal(const char* member, int i) {
+    DBusMessage* signal = dbus_message_new_signal(kPath, kInterface, member);
+    char address[18];
+    std::snprintf(address, sizeof address, "00:11:22:%02X:%02X:%02X", (i >> 16) & 255, (i >> 8) & 255, i & 255);
+    const char* text = address;
+    DBusMessageIter args, dict;
+    dbus_message_iter_init_append(signal, &args);
+    dbus_message_iter_append_basic(&args, DBUS_TYPE_STRING, &text);
+    dbus_message_iter_open_container(&args, DBUS_TYPE_ARRAY, "{sv}", &dict);
+    auto entry = [&](const char* name, int type, const char* signature, const void* value) {
+        appendEntry(dict, name, type, signature, value);
+    };
+    dbus_uint32_t cls = 0x5a020c;
+    dbus_int16_t rssi = -61;
+    dbus_bool_t no = FALSE;
+    const char* name = "phone";
+    entry("Address", DBUS_TYPE_STRING, "s", &text);
+    entry("Class", DBUS_TYPE_UINT32, "u", &cls);
+    entry("RSSI", DBUS_TYPE_INT16, "n", &rssi);
+    entry("Name", DBUS_TYPE_STRING, "s", &name);
+    entry("Paired", DBUS_TYPE_BOOLEAN, "b", &no);
+    dbus_message_iter_close_container(&args, &dict);
+    return signal;
+}
+
+std::atomic<int> gFound{ 0 };
+std::atomic<bool> gStormOver{ false };
+
+void onFound(Bluetooth::RemoteObject*, const char*, const Bluetooth::Dict* properties) {
+    if (properties->size() == 5) ++gFound;
+}
+
+// Reads RawFound signals with raw libdbus, every value of each, until count came.
+void rawReceive(DBusConnection* connection, int count) {
+    while (gFound < count && !gStormOver) {
+        dbus_connection_read_write(connection, 100);
+        while (DBusMessage* message = dbus_connection_pop_message(connection)) {
+            if (dbus_message_is_signal(message, kInterface, "RawFound")) {
+                DBusMessageIter args;
+                dbus_message_iter_init(message, &args);
+                dbus_message_iter_next(&args);
+                DBusMessageIter dict;
+                size_t seen = 0;
+                for (dbus_message_iter_recurse(&args, &dict); dbus_message_iter_get_arg_type(&dict) == DBUS_TYPE_DICT_ENTRY;
+                     dbus_message_iter_next(&dict)) {
+                    DBusMessageIter e, v;
+                    dbus_message_iter_recurse(&dict, &e);
+                    dbus_message_iter_next(&e);
+                    dbus_message_iter_recurse(&e, &v);
+                    DBusBasicValue value;
+                    dbus_message_iter_get_basic(&v, &value);
+                    ++seen;
+                }
+                if (seen == 5) ++gFound;
+            }
+            dbus_message_unref(message);
+        }
+    }
+}
+
+// Seconds from the first signal sent to the last one handled, or -1 if any
+// was lost (none came for a second).
+double storm(DBusConnection* emitter, const char* member, int count, const std::function<void()>& startReceiver) {
+    std::vector<DBusMessage*> signals;
+    for (int i = 0; i < count; ++i) signals.push_back(foundSignal(member, i));
+    gFound = 0;
+    startReceiver();
+    auto start = Clock::now();
+    for (int i = 0; i < count; ++i) {
+        dbus_connection_send(emitter, signals[i], nullptr);
+        if (i % 256 == 255) dbus_connection_flush(emitter);
+    }
+    dbus_connection_flush(emitter);
+    int last = -1;
+    auto lastChange = Clock::now();
+    while (gFound < count) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+        if (gFound != last) {
+            last = gFound;
+            lastChange = Clock::now();
+        } else if (Clock::now() - lastChange > std::chrono::seconds(1)) {
+            break;
+        }
+    }
+    double seconds = std::chrono::duration<double>(Clock::now() - start).count();
+    for (DBusMessage* signal : signals) dbus_message_unref(signal);
+    return gFound == count ? seconds : -1;
 }
 
 long contextSwitches() {
@@ -293,6 +415,17 @@ long contextSwitches() {
 }  // namespace
 
 int main(int argc, char** argv) {
+    if (argc > 1 && std::string(argv[1]) == "decode") {
+        // Only the decoding, with no bus, for an instruction count under
+        // callgrind: compare the inclusive costs of rawWalk and libraryDecode.
+        setenv("DBUS_SESSION_BUS_ADDRESS", "unix:path=/nonexistent/btbus-bench", 1);
+        DBusMessage* reply = propertiesReply();
+        Bluetooth::RemoteObject reader("org.bluez", "/", "org.bluez.Adapter", DBUS_BUS_SESSION);
+        size_t sink = 0;
+        for (int i = 0; i < 1000; ++i) sink += rawWalk(reply) + libraryDecode(reader, reply);
+        dbus_message_unref(reply);
+        return sink != 0 ? 0 : 1;
+    }
     int signals = argc > 1 ? std::atoi(argv[1]) : 200;
     int calls = argc > 2 ? std::atoi(argv[2]) : 5000;
     std::string address = startBus();
@@ -359,6 +492,26 @@ int main(int argc, char** argv) {
     long idleSwitches = contextSwitches() - idleBefore;
     Percentiles loopLatency = measureLatency(emitter, signals);
     double loopRatio = ratio([&] { return libraryCalls(caller, calls); }, withLoop);
+
+    // Each receiver gets its own signals only: the raw one RawFound, the
+    // library's handler Found.
+    const int kStorm = 100000;
+    std::vector<double> oneWay, found;
+    dbus_bus_remove_match(blind, rule.c_str(), nullptr);
+    dbus_bus_add_match(blind, (rule + ",member='RawFound'").c_str(), nullptr);
+    caller.setSignalHandlerStringDict("Found", &onFound);
+    for (int round = 0; round < kRounds; ++round) {
+        oneWay.push_back(libraryOneWay(caller, calls) / rawOneWay(rawCaller, calls));
+        std::thread rawThread;
+        double raw = storm(emitter, "RawFound", kStorm, [&] { rawThread = std::thread(rawReceive, blind, kStorm); });
+        gStormOver = true;
+        rawThread.join();
+        gStormOver = false;
+        double library = storm(emitter, "Found", kStorm, [] {});
+        found.push_back(raw > 0 && library > 0 ? library / raw : -1);
+    }
+    std::sort(oneWay.begin(), oneWay.end());
+    std::sort(found.begin(), found.end());
     caller.stopLoop();
     caller.waitLoop();
 
@@ -371,6 +524,11 @@ int main(int argc, char** argv) {
     std::printf("  btbus, btbus loop           %8.1f us   %.2f\n\n", withLoop * 1e6, loopRatio);
     std::printf("decoding a 12-entry GetProperties reply into a Dict: %.2f x a raw iterator walk\n",
                 decodeRatio(kRounds, 20000));
+    std::printf("one-way calls: %.2f x raw libdbus\n", oneWay[kRounds / 2]);
+    if (found.front() < 0)
+        std::printf("%d DeviceFound signals: LOST some\n", kStorm);
+    else
+        std::printf("%d DeviceFound signals, none lost: %.2f x raw libdbus\n", kStorm, found[kRounds / 2]);
     std::printf("context switches in 2 idle seconds: %ld with an idle loop, %ld without\n", idleSwitches,
                 quietSwitches);
 

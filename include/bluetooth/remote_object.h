@@ -61,9 +61,11 @@ typedef void (*SignalFunctionStringDict)(RemoteObject* object, const char* name,
 //   handlers, and the requests the process's Agent answers, run on a receiving
 //   thread, one at a time, outside libdbus's own locks.
 // - Blocking calls from any thread, a handler included, wait without holding the
-//   connection: while a receiving thread is free it reads their replies; while it
-//   is busy in a handler, a waiting thread reads them itself. sendMessagePending
-//   also answers the Agent's requests meanwhile, so pairing works from any thread.
+//   connection. A waiting thread reads a quick reply itself and leaves what else
+//   it reads to a receiving thread; a free receiving thread reads slower replies;
+//   while every receiving thread is busy in a handler, a waiting thread reads and
+//   dispatches itself. sendMessagePending also answers the Agent's requests
+//   meanwhile, so pairing works from any thread.
 // - A handler may make calls, register handlers, and create or destroy proxies,
 //   its own included. Destroying a proxy removes its handlers and waits for a
 //   handler of it that runs on another thread to return. Destroying the object a

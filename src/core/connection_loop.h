@@ -22,8 +22,10 @@ namespace internal {
 // Dispatching never runs callers' code: signals and deferred method calls are
 // queued and run by a receiving thread (or, for method calls, by a thread
 // waiting in a pending call), outside libdbus's dispatch lock. So whoever reads
-// the socket is never held up, and a thread waiting for a reply may read it
-// itself while every receiving thread is busy in a handler.
+// the socket is never held up. A thread waiting for a reply reads the socket
+// itself at first and takes its reply off the queue, so that a quick reply
+// wakes one thread; what else it reads it leaves to a receiving thread to
+// dispatch, unless every receiving thread is busy in a handler.
 class ConnectionLoop {
 public:
     // The loop of connection, made on first use and kept as long as the

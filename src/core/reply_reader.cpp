@@ -1,6 +1,8 @@
 #include <bluetooth/remote_object.h>
 
 #include <cstdio>
+#include <tuple>
+#include <utility>
 
 #include "core/dbus_holders.h"
 #include "core/decode.h"
@@ -11,21 +13,24 @@ namespace internal {
 
 namespace {
 
-bool isText(int type) {
-    return type == DBUS_TYPE_STRING || type == DBUS_TYPE_OBJECT_PATH || type == DBUS_TYPE_SIGNATURE;
-}
+const size_t kTextsGuess = 8;
 
-// Reads an array of texts into values. The element type is checked before any
-// element is read, because reading a number as a text would crash.
-bool readTexts(DBusMessageIter& array, std::vector<std::string>& values) {
+// Reads an array of texts (signatures too, if asked) into values. The element
+// type is checked before any element is read: reading a number as a text would
+// crash.
+bool readTexts(DBusMessageIter& array, std::vector<std::string>& values, bool signatures) {
     DBusMessageIter element;
     dbus_message_iter_recurse(&array, &element);
     int type = typeOf(element);
     if (type == DBUS_TYPE_INVALID) return true;
-    if (!isText(type)) return false;
-    values.reserve(values.size() + static_cast<size_t>(dbus_message_iter_get_element_count(&array)));
+    if (type != DBUS_TYPE_STRING && type != DBUS_TYPE_OBJECT_PATH &&
+        (type != DBUS_TYPE_SIGNATURE || !signatures))
+        return false;
+    // A guess (libdbus counts an array's elements by walking it): most lists
+    // are short, and growing one from nothing reallocates it three times.
+    if (values.capacity() - values.size() < kTextsGuess) values.reserve(values.size() + kTextsGuess);
     do
-        values.push_back(readText(element));
+        values.emplace_back(readText(element));
     while (dbus_message_iter_next(&element));
     return true;
 }
@@ -34,30 +39,43 @@ bool readTexts(DBusMessageIter& array, std::vector<std::string>& values) {
 // entries, and growing entry by entry moves every entry several times.
 const size_t kEntriesGuess = 16;
 
-}  // namespace
-
-int decodeName(DBusMessageIter& iterator, std::string& name) {
-    int type = typeOf(iterator);
-    if (type == DBUS_TYPE_STRING) {
-        name = readText(iterator);
-        return 0;
-    }
-    if (type == DBUS_TYPE_UINT32) {
-        dbus_uint32_t number = 0;
-        dbus_message_iter_get_basic(&iterator, &number);
-        char text[16];
-        std::snprintf(text, sizeof text, "%u", static_cast<unsigned>(number));
-        name = text;
-        return 0;
-    }
-    return 4;
+// The text of an entry name of type: a string's own, or a number written into
+// digits; null for another type. Names and values are decoded for types already known:
+// every entry of a dictionary has the same types, asked for once.
+typedef char Digits[16];
+const char* nameOf(int type, DBusMessageIter& iterator, Digits& digits) {
+    if (type == DBUS_TYPE_STRING) return readText(iterator);
+    if (type != DBUS_TYPE_UINT32) return 0;
+    dbus_uint32_t number = 0;
+    dbus_message_iter_get_basic(&iterator, &number);
+    std::snprintf(digits, sizeof digits, "%u", static_cast<unsigned>(number));
+    return digits;
 }
 
-int decodeValue(DBusMessageIter& iterator, Variant& value) {
-    int type = typeOf(iterator);
-    VariantBase& held = value;  // assigned in place, without a temporary Variant
+// Where a decoded value goes: into a variant that is there already, or into a
+// new last entry of a dictionary, built in place with its name.
+struct IntoVariant {
+    VariantBase& held;
+    template <typename T>
+    void operator()(T&& value) const {
+        held = std::forward<T>(value);
+    }
+};
+
+struct IntoNewEntry {
+    Dict& dict;
+    const char* name;
+    template <typename T>
+    void operator()(T&& value) const {
+        dict.emplace_back(std::piecewise_construct, std::forward_as_tuple(name),
+                          std::forward_as_tuple(std::forward<T>(value)));
+    }
+};
+
+template <typename Sink>
+int decodeValueOf(int type, DBusMessageIter& iterator, const Sink& sink) {
     if (type == DBUS_TYPE_STRING) {
-        held = std::string(readText(iterator));
+        sink(std::string(readText(iterator)));
         return 0;
     }
     if (type != DBUS_TYPE_VARIANT) return 4;
@@ -67,41 +85,35 @@ int decodeValue(DBusMessageIter& iterator, Variant& value) {
     case DBUS_TYPE_UINT32: {
         dbus_uint32_t number = 0;
         dbus_message_iter_get_basic(&inner, &number);
-        held = static_cast<unsigned int>(number);
+        sink(static_cast<unsigned int>(number));
         return 0;
     }
     case DBUS_TYPE_UINT16: {
         dbus_uint16_t number = 0;
         dbus_message_iter_get_basic(&inner, &number);
-        held = static_cast<unsigned short>(number);
+        sink(static_cast<unsigned short>(number));
         return 0;
     }
     case DBUS_TYPE_BOOLEAN: {
         dbus_bool_t truth = FALSE;
         dbus_message_iter_get_basic(&inner, &truth);
-        held = truth != 0;
+        sink(truth != 0);
         return 0;
     }
     case DBUS_TYPE_STRING:
     case DBUS_TYPE_OBJECT_PATH:
-        held = std::string(readText(inner));
+        sink(std::string(readText(inner)));
         return 0;
     case DBUS_TYPE_INT16: {
         dbus_int16_t number = 0;
         dbus_message_iter_get_basic(&inner, &number);
-        held = static_cast<int>(number);
+        sink(static_cast<int>(number));
         return 0;
     }
     case DBUS_TYPE_ARRAY: {
-        DBusMessageIter element;
-        dbus_message_iter_recurse(&inner, &element);
-        int elementType = typeOf(element);
-        if (elementType != DBUS_TYPE_INVALID && elementType != DBUS_TYPE_STRING &&
-            elementType != DBUS_TYPE_OBJECT_PATH)
-            return 4;
-        // Filled in place: the list is not copied.
-        held = std::vector<std::string>();
-        readTexts(inner, boost::get<std::vector<std::string> >(held));
+        std::vector<std::string> texts;
+        if (!readTexts(inner, texts, false)) return 4;
+        sink(std::move(texts));  // moved, not copied
         return 0;
     }
     default:
@@ -109,30 +121,41 @@ int decodeValue(DBusMessageIter& iterator, Variant& value) {
     }
 }
 
+}  // namespace
+
+int decodeName(DBusMessageIter& iterator, std::string& name) {
+    Digits digits;
+    const char* text = nameOf(typeOf(iterator), iterator, digits);
+    if (text == 0) return 4;
+    name = text;
+    return 0;
+}
+
+int decodeValue(DBusMessageIter& iterator, Variant& value) {
+    IntoVariant into = { value };
+    return decodeValueOf(typeOf(iterator), iterator, into);
+}
+
 EntriesResult decodeEntries(DBusMessageIter& array, Dict& dict) {
     DBusMessageIter element;
     dbus_message_iter_recurse(&array, &element);
+    if (typeOf(element) != DBUS_TYPE_DICT_ENTRY) return kEntriesDecoded;  // none
     if (dict.capacity() - dict.size() < kEntriesGuess) dict.reserve(dict.size() + kEntriesGuess);
-    for (; typeOf(element) == DBUS_TYPE_DICT_ENTRY; dbus_message_iter_next(&element)) {
+    int nameType = DBUS_TYPE_INVALID;
+    int valueType = DBUS_TYPE_INVALID;
+    do {
         DBusMessageIter field;
         dbus_message_iter_recurse(&element, &field);
-        // Decoded in place, and taken back when it fails or ends the dictionary.
-        dict.push_back(Entry());
-        Entry& entry = dict.back();
-        if (decodeName(field, entry.first) != 0) {
-            dict.pop_back();
-            return kBadEntryName;
-        }
-        if (entry.first.empty()) {  // ends the dictionary quietly, on purpose
-            dict.pop_back();
-            break;
-        }
+        if (nameType == DBUS_TYPE_INVALID) nameType = typeOf(field);
+        Digits digits;
+        const char* name = nameOf(nameType, field, digits);
+        if (name == 0) return kBadEntryName;
+        if (*name == '\0') break;  // ends the dictionary quietly, on purpose
         dbus_message_iter_next(&field);
-        if (decodeValue(field, entry.second) != 0) {
-            dict.pop_back();
-            return kBadEntryValue;
-        }
-    }
+        if (valueType == DBUS_TYPE_INVALID) valueType = typeOf(field);
+        IntoNewEntry into = { dict, name };
+        if (decodeValueOf(valueType, field, into) != 0) return kBadEntryValue;
+    } while (dbus_message_iter_next(&element));
     return kEntriesDecoded;
 }
 
@@ -204,7 +227,7 @@ int RemoteObject::readStringArray(std::vector<std::string>& values) {
     if (!taken) return -1;
     if (typeOf(arguments) != DBUS_TYPE_ARRAY) return fail(4);
     values.clear();
-    return internal::readTexts(arguments, values) ? 0 : fail(4);
+    return internal::readTexts(arguments, values, true) ? 0 : fail(4);
 }
 
 int RemoteObject::getReplyValue(std::vector<std::string>& values) { return readStringArray(values); }
