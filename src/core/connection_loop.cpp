@@ -537,12 +537,13 @@ ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, Waiter* wa
                                                                     youngUntil - now).count()) + 1
                                              : kSliceMs);
             pumping_ = true;
+            receiverPumping_ = receiving;
             readerWaiter_ = waiter;
             hold.unlock();
             DBusMessage* mine = pump(slice, serial, !young);
             bool remains = young && dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_DATA_REMAINS;
             hold.lock();
-            pumping_ = false;
+            pumping_ = receiverPumping_ = false;
             readerWaiter_ = 0;
             pumpFreeSince_ = Clock::now();
             if (young) handBackAt_ = pumpFreeSince_ + milliseconds(kHandBackMs);

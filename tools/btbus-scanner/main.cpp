@@ -18,8 +18,9 @@ const char kUsage[] =
     "It exits with status 0 thirty seconds after the last discovery was started,\n"
     "or on SIGTERM or SIGINT; the bus starts it again on the next call.\n";
 
+// GLib calls it only from the server's running loop.
 gboolean quit(gpointer server) {
-    static_cast<Bluetooth::ScannerServer*>(server)->quitLoop();
+    (*static_cast<Bluetooth::ScannerServer**>(server))->quitLoop();
     return G_SOURCE_CONTINUE;
 }
 
@@ -40,10 +41,14 @@ int main(int argc, char** argv) {
     // is about 2 MB, built twice) go back to the system when freed, instead of
     // raising glibc's moving threshold and staying resident for the daemon's life.
     mallopt(M_MMAP_THRESHOLD, 128 * 1024);
+    // Caught before the name is claimed: a stop asked for while the adapters
+    // are set up ends the loop as soon as it runs.
+    Bluetooth::ScannerServer* running = nullptr;
+    guint term = g_unix_signal_add(SIGTERM, &quit, &running);
+    guint interrupt = g_unix_signal_add(SIGINT, &quit, &running);
     Bluetooth::ScannerServer server;
+    running = &server;
     for (int i = 1; i < argc; ++i) server.addAdapterFounder(argv[i]);
-    guint term = g_unix_signal_add(SIGTERM, &quit, &server);
-    guint interrupt = g_unix_signal_add(SIGINT, &quit, &server);
     server.startLoop();
     g_source_remove(term);
     g_source_remove(interrupt);
