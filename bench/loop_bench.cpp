@@ -67,7 +67,7 @@ void servePeer(DBusConnection* connection) {
     while (!gPeerStop) {
         dbus_connection_read_write(connection, 20);
         while (DBusMessage* message = dbus_connection_pop_message(connection)) {
-            if (dbus_message_is_method_call(message, kInterface, "Echo")) {
+            if (dbus_message_is_method_call(message, kInterface, "Echo") && !dbus_message_get_no_reply(message)) {
                 DBusMessage* reply = dbus_message_new_method_return(message);
                 dbus_connection_send(connection, reply, nullptr);
                 dbus_message_unref(reply);
