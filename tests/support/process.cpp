@@ -7,7 +7,7 @@
 
 #include <fcntl.h>
 #include <poll.h>
-#include <spawn.h>
+#include <sys/prctl.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -18,29 +18,64 @@ extern char** environ;
 
 namespace btbus_test {
 
+namespace {
+
+// argv0 as execvp would find it, resolved before the fork: the child of a
+// threaded process may only make async-signal-safe calls.
+std::string onPath(const std::string& argv0) {
+    if (argv0.find('/') != std::string::npos) return argv0;
+    const char* path = std::getenv("PATH");
+    std::string dirs = path != nullptr ? path : "/usr/bin:/bin";
+    for (size_t begin = 0; begin <= dirs.size();) {
+        size_t end = dirs.find(':', begin);
+        if (end == std::string::npos) end = dirs.size();
+        std::string candidate = dirs.substr(begin, end - begin) + "/" + argv0;
+        if (access(candidate.c_str(), X_OK) == 0) return candidate;
+        begin = end + 1;
+    }
+    return argv0;
+}
+
+}  // namespace
+
+// Forked rather than spawned so that the child is told to end when this
+// process does, even by a crash: a crashed test leaves no daemon behind.
 pid_t spawn(const std::vector<std::string>& argv, int* stdoutFd) {
+    std::string program = onPath(argv[0]);
     std::vector<char*> args;
     for (const std::string& arg : argv) args.push_back(const_cast<char*>(arg.c_str()));
     args.push_back(nullptr);
-    posix_spawn_file_actions_t actions;
-    posix_spawn_file_actions_init(&actions);
     int out[2] = { -1, -1 };
-    if (stdoutFd != nullptr) {
-        if (pipe2(out, O_CLOEXEC) != 0) {
-            ADD_FAILURE() << "pipe: " << strerror(errno);
-            return -1;
-        }
-        posix_spawn_file_actions_adddup2(&actions, out[1], 1);
+    int failure[2] = { -1, -1 };  // the child's errno if it cannot exec
+    if ((stdoutFd != nullptr && pipe2(out, O_CLOEXEC) != 0) || pipe2(failure, O_CLOEXEC) != 0) {
+        ADD_FAILURE() << "pipe: " << strerror(errno);
+        return -1;
     }
-    pid_t pid = -1;
-    int rc = posix_spawnp(&pid, args[0], &actions, nullptr, args.data(), environ);
-    posix_spawn_file_actions_destroy(&actions);
+    pid_t parent = getpid();
+    pid_t pid = fork();
+    if (pid == 0) {
+        prctl(PR_SET_PDEATHSIG, SIGTERM);
+        if (getppid() != parent) _exit(127);  // already orphaned
+        if (stdoutFd != nullptr) dup2(out[1], 1);
+        execve(program.c_str(), args.data(), environ);
+        int error = errno;
+        ssize_t written = write(failure[1], &error, sizeof error);
+        (void)written;
+        _exit(127);
+    }
+    int error = pid < 0 ? errno : 0;
+    close(failure[1]);
+    if (pid > 0 && read(failure[0], &error, sizeof error) == static_cast<ssize_t>(sizeof error))
+        waitpid(pid, nullptr, 0);
+    else if (pid > 0)
+        error = 0;
+    close(failure[0]);
     if (stdoutFd != nullptr) {
         close(out[1]);
         *stdoutFd = out[0];
     }
-    if (rc != 0) {
-        ADD_FAILURE() << "cannot start " << argv[0] << ": " << strerror(rc);
+    if (error != 0) {
+        ADD_FAILURE() << "cannot start " << argv[0] << ": " << strerror(error);
         return -1;
     }
     return pid;
