@@ -137,7 +137,6 @@ def load(mock, parameters):
     mock.ticks = 0
     mock.ticker = None
     mock.recorded = []
-    mock.last_answer = ''
 
     for name, (signature, make) in REPLIES.items():
         mock.AddMethod(MAIN_IFACE, name, '', signature, lambda self, make=make: make())
@@ -152,8 +151,6 @@ def load(mock, parameters):
     mock.AddMethod(MAIN_IFACE, 'Recorded', '', 'as', lambda self: dbus.Array(self.recorded, signature='s'))
     mock.AddMethod(MAIN_IFACE, 'ClearRecorded', '', '', clear_recorded)
     mock.AddMethod(MAIN_IFACE, 'CallBack', 'so', 's', call_back)
-    mock.AddMethod(MAIN_IFACE, 'CallBackLater', 'so', '', call_back_later)
-    mock.AddMethod(MAIN_IFACE, 'LastAnswer', '', 's', lambda self: self.last_answer)
     mock.AddMethod(MAIN_IFACE, 'Emit', 's', '', emit_kind)
     mock.AddMethod(MAIN_IFACE, 'StartTicking', 'u', '', start_ticking)
     mock.AddMethod(MAIN_IFACE, 'StopTicking', '', 's', stop_ticking)
@@ -186,24 +183,6 @@ def call_back(self, name, path):
     '''Calls the caller back before answering: the caller must dispatch while it waits.'''
     answer = callback_proxy(self, name, path).Ping('ping', dbus_interface=CALLBACK_IFACE, timeout=10)
     return 'called back: ' + answer
-
-
-def call_back_later(self, name, path):
-    '''Calls the caller once this call has been answered; LastAnswer tells the outcome.'''
-    self.last_answer = ''
-
-    def done(answer):
-        self.last_answer = str(answer)
-
-    def failed(error):
-        self.last_answer = 'error ' + error.get_dbus_name()
-
-    def later():
-        callback_proxy(self, name, path).Ping('later', dbus_interface=CALLBACK_IFACE, timeout=10,
-                                              reply_handler=done, error_handler=failed)
-        return False
-
-    GLib.idle_add(later)
 
 
 def emit_kind(self, kind):
