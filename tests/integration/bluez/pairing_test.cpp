@@ -86,21 +86,17 @@ protected:
     std::string prefix;
 };
 
-// True in a fresh run of this test, where no receiving thread runs yet; in
-// the parent, runs the test there and returns false.
-bool inFreshProcess() {
-    if (btbus_test::childRole() == "fresh") return true;
-    const testing::TestInfo* test = testing::UnitTest::GetInstance()->current_test_info();
-    EXPECT_EQ(btbus_test::runInChild(std::string(test->test_suite_name()) + "." + test->name(), "fresh"), 0);
-    return false;
-}
-
-TEST_F(APairing, AnswersAPinRequestWithThePasskeyTextAndIsReleasedAfterwards) {
+TEST_F(APairing, AnswersAPinRequestWithThePasskeyTextAfterTheDelayAndIsReleasedAfterwards) {
     sim::receivingLoop();  // Release may follow the reply
     ASSERT_EQ(agent.setPasskeyValue("0000"), 0);
+    ASSERT_EQ(agent.setPasskeyDelay(1), 0);
     LogCapture log;
+    auto start = std::chrono::steady_clock::now();
     std::unique_ptr<Device> keyboard(adapter->createPairedDevice(kKeyboard, agent));
+    auto took = std::chrono::steady_clock::now() - start;
     ASSERT_NE(keyboard, nullptr) << adapter->getErrorMessage();
+    EXPECT_GE(took, 1s);
+    EXPECT_LT(took, 5s);
     EXPECT_EQ(keyboard->getPath(), sim::devicePath(kKeyboard));
     EXPECT_EQ(agentCalls(), (std::vector<std::string>{ call("RequestPinCode(" + sim::devicePath(kKeyboard) + ") -> 0000"),
                                                        call("Release() -> sent") }));
@@ -158,17 +154,6 @@ TEST_F(APairing, AnswersEachKindOfRequestAsItsSettingsSay) {
     }
 }
 
-TEST_F(APairing, WaitsForTheDelayBeforeAnswering) {
-    ASSERT_EQ(agent.setPasskeyValue("0000"), 0);
-    ASSERT_EQ(agent.setPasskeyDelay(1), 0);
-    auto start = std::chrono::steady_clock::now();
-    std::unique_ptr<Device> keyboard(adapter->createPairedDevice(kKeyboard, agent));
-    auto took = std::chrono::steady_clock::now() - start;
-    EXPECT_NE(keyboard, nullptr) << adapter->getErrorMessage();
-    EXPECT_GE(took, 1s);
-    EXPECT_LT(took, 5s);
-}
-
 TEST_F(APairing, ForwardsACancellationToTheAgentAndFails) {
     sim::receivingLoop();  // to dispatch what arrives after the call returned
     ASSERT_EQ(agent.setPasskeyValue("0000"), 0);
@@ -197,18 +182,6 @@ TEST_F(APairing, ReleasesTheAgentWhenTheDeviceCannotBeReached) {
     EXPECT_TRUE(waitUntil([] { return reached("Release"); }));
 }
 
-TEST_F(APairing, IsAnsweredOnTheCallersThreadWhenNoReceivingThreadRuns) {
-    if (!inFreshProcess()) return;
-    ASSERT_FALSE(sim::receivingLoopRunning());
-    ASSERT_EQ(agent.setPasskeyValue("0000"), 0);
-    std::unique_ptr<Device> keyboard(adapter->createPairedDevice(kKeyboard, agent));
-    EXPECT_NE(keyboard, nullptr) << adapter->getErrorMessage();
-    std::lock_guard<std::mutex> lock(gLock);
-    ASSERT_FALSE(gThreads.empty());
-    EXPECT_EQ(gMembers[0], "RequestPinCode");
-    EXPECT_EQ(gThreads[0], std::this_thread::get_id());
-}
-
 TEST_F(APairing, AgentAuthorisesIncomingConnectionsOnTheReceivingThread) {
     ASSERT_NO_FATAL_FAILURE(registerWithAdapter());
     // Nothing dispatches the connection on this thread: only the receiving thread can answer.
@@ -225,53 +198,40 @@ TEST_F(APairing, AgentAuthorisesIncomingConnectionsOnTheReceivingThread) {
     EXPECT_NE(gThreads[1], std::this_thread::get_id());
 }
 
-// A raw connection of the test's own, calling the agent the way a peer would.
-class RawCaller {
-public:
-    RawCaller() {
-        connection_ = dbus_bus_get_private(DBUS_BUS_SYSTEM, nullptr);
-        if (connection_ != nullptr) dbus_connection_set_exit_on_disconnect(connection_, FALSE);
+// Calls the agent from a connection of the test's own, the way a peer would:
+// the error name of the answer ("" for a method return).
+std::string callAsAPeer(const std::string& destination, const char* path, const char* member, int timeoutMs,
+                        bool withDeviceAndPasskey) {
+    DBusConnection* connection = dbus_bus_get_private(DBUS_BUS_SYSTEM, nullptr);
+    if (connection == nullptr) return "no connection";
+    dbus_connection_set_exit_on_disconnect(connection, FALSE);
+    Bluetooth::internal::MessagePtr message(
+        dbus_message_new_method_call(destination.c_str(), path, "org.bluez.Agent", member));
+    if (withDeviceAndPasskey) {
+        const char* device = "/org/bluez/1/hci0/dev_00_11_22_33_44_55";
+        dbus_uint32_t passkey = 123456;
+        dbus_message_append_args(message.get(), DBUS_TYPE_OBJECT_PATH, &device, DBUS_TYPE_UINT32, &passkey,
+                                 DBUS_TYPE_INVALID);
     }
-    ~RawCaller() {
-        if (connection_ == nullptr) return;
-        dbus_connection_close(connection_);
-        dbus_connection_unref(connection_);
-    }
-    // The error name of the answer ("" for a method return).
-    std::string call(const std::string& destination, const char* path, const char* member,
-                     int timeoutMs, bool withDeviceAndPasskey) {
-        Bluetooth::internal::MessagePtr message(
-            dbus_message_new_method_call(destination.c_str(), path, "org.bluez.Agent", member));
-        if (withDeviceAndPasskey) {
-            const char* device = "/org/bluez/1/hci0/dev_00_11_22_33_44_55";
-            dbus_uint32_t passkey = 123456;
-            dbus_message_append_args(message.get(), DBUS_TYPE_OBJECT_PATH, &device, DBUS_TYPE_UINT32,
-                                     &passkey, DBUS_TYPE_INVALID);
-        }
-        Bluetooth::internal::ScopedError error;
-        Bluetooth::internal::MessagePtr reply(dbus_connection_send_with_reply_and_block(
-            connection_, message.get(), timeoutMs, error.get()));
-        return error.name();
-    }
-    bool ok() const { return connection_ != nullptr; }
-
-private:
-    DBusConnection* connection_ = nullptr;
-};
+    Bluetooth::internal::ScopedError error;
+    Bluetooth::internal::MessagePtr reply(
+        dbus_connection_send_with_reply_and_block(connection, message.get(), timeoutMs, error.get()));
+    dbus_connection_close(connection);
+    dbus_connection_unref(connection);
+    return error.name();
+}
 
 TEST_F(APairing, AgentLogsAndLeavesUnansweredWhatItCannotHandle) {
     sim::receivingLoop();
-    RawCaller peer;
-    ASSERT_TRUE(peer.ok());
     const std::string me = adapter->getConnectionName();
     LogCapture log;
     // Not the agent's answer: libdbus answers what no handler took.
-    EXPECT_EQ(peer.call(me, agent.getPath(), "DisplayPasskey", 3000, true),
+    EXPECT_EQ(callAsAPeer(me, agent.getPath(), "DisplayPasskey", 3000, true),
               "org.freedesktop.DBus.Error.UnknownMethod");
-    EXPECT_EQ(peer.call(me, agent.getPath(), "RequestPasskey", 3000, false),
+    EXPECT_EQ(callAsAPeer(me, agent.getPath(), "RequestPasskey", 3000, false),
               "org.freedesktop.DBus.Error.UnknownMethod");
     // Bad arguments of a PIN request count as handled: no answer at all.
-    EXPECT_EQ(peer.call(me, agent.getPath(), "RequestPinCode", 300, false),
+    EXPECT_EQ(callAsAPeer(me, agent.getPath(), "RequestPinCode", 300, false),
               "org.freedesktop.DBus.Error.NoReply");
     EXPECT_EQ(log.lines(), (std::vector<std::string>{
                                "agent.cpp:410 Registered agent does not provide a handler for the incoming message.",
@@ -279,7 +239,7 @@ TEST_F(APairing, AgentLogsAndLeavesUnansweredWhatItCannotHandle) {
                                "agent.cpp:167 Failed to get argument from request pin code message." }));
 }
 
-TEST_F(APairing, AgentPathIsRegisteredOncePerProcess) {
+TEST_F(APairing, AgentPathIsRegisteredOncePerProcessAndFreedWhenItsAgentIsDestroyed) {
     LogCapture log;
     Agent second;
     EXPECT_EQ(second.registerPath(), -1);
@@ -292,12 +252,34 @@ TEST_F(APairing, AgentPathIsRegisteredOncePerProcess) {
     EXPECT_EQ(log.lines(), (std::vector<std::string>{ "agent.cpp:54 Failed to register agent path to dbus.",
                                                       "agent.cpp:65 Failed to unregister agent path from dbus.",
                                                       "agent.cpp:65 Failed to unregister agent path from dbus." }));
+    sim::receivingLoop();
+    auto forgotten = std::make_unique<Agent>();
+    ASSERT_EQ(forgotten->registerPath(), 0);
+    const std::string path = forgotten->getPath();
+    forgotten.reset();  // without unregisterPath
+    EXPECT_EQ(callAsAPeer(adapter->getConnectionName(), path.c_str(), "Release", 3000, false),
+              "org.freedesktop.DBus.Error.UnknownMethod");
+    EXPECT_EQ(agent.registerPath(), 0);
 }
 
-TEST_F(APairing, AnswersABlockingPairingCallMadeBeforeAnyLoopStarted) {
-    if (!inFreshProcess()) return;
+TEST_F(APairing, WithoutAReceivingThreadIsAnsweredOnTheCallersThreadOrOnceALoopStarts) {
+    if (btbus_test::childRole() != "no-loop") {
+        // Another receiving thread may already run here: run it in a fresh process.
+        EXPECT_EQ(btbus_test::runInChild(
+                      "APairing.WithoutAReceivingThreadIsAnsweredOnTheCallersThreadOrOnceALoopStarts", "no-loop"), 0);
+        return;
+    }
     ASSERT_FALSE(sim::receivingLoopRunning());
     ASSERT_EQ(agent.setPasskeyValue("0000"), 0);
+    std::unique_ptr<Device> keyboard(adapter->createPairedDevice(kKeyboard, agent));
+    EXPECT_NE(keyboard, nullptr) << adapter->getErrorMessage();
+    {
+        std::lock_guard<std::mutex> lock(gLock);
+        ASSERT_FALSE(gThreads.empty());
+        EXPECT_EQ(gMembers[0], "RequestPinCode");
+        EXPECT_EQ(gThreads[0], std::this_thread::get_id());
+    }
+    ASSERT_TRUE(sim::start());  // the keyboard unpaired again
     // A plain blocking call answers nobody's requests: the agent's PIN request
     // waits for the loop started after the call was made.
     std::thread caller([this] {
@@ -337,20 +319,6 @@ TEST_F(APairing, AgentAnswersAnIncomingPinRequestLeavingOtherCallsPromptAndIsRel
     EXPECT_EQ(agentCalls(), (std::vector<std::string>{
                                 call("RequestPinCode(" + sim::devicePath(kKeyboard) + ") -> 0000"),
                                 call("Release() -> sent") }));
-}
-
-TEST_F(APairing, AgentDestroyedWhileRegisteredFreesItsPath) {
-    sim::receivingLoop();
-    agent.unregisterPath();
-    auto forgotten = std::make_unique<Agent>();
-    ASSERT_EQ(forgotten->registerPath(), 0);
-    std::string path = forgotten->getPath();
-    forgotten.reset();  // without unregisterPath
-    RawCaller peer;
-    ASSERT_TRUE(peer.ok());
-    EXPECT_EQ(peer.call(adapter->getConnectionName(), path.c_str(), "Release", 3000, false),
-              "org.freedesktop.DBus.Error.UnknownMethod");
-    EXPECT_EQ(agent.registerPath(), 0);
 }
 
 }  // namespace
