@@ -31,7 +31,7 @@ TEST(AnAgent, StartsWithItsDefaultAnswersAndNoPath) {
     EXPECT_STREQ(Agent::PSZ_DISPLAY_ONLY, "DisplayOnly");
 }
 
-TEST(AnAgent, RefusesANullPasskeyAndANegativeDelayLoggingAndKeepingTheOldValue) {
+TEST(AnAgent, RefusesNullSettingsAndANegativeDelayKeepingTheOldValuesAndLogsOnlyThePasskeys) {
     LogCapture log;
     Agent agent;
     EXPECT_EQ(agent.setPasskeyValue("123456"), 0);
@@ -42,14 +42,6 @@ TEST(AnAgent, RefusesANullPasskeyAndANegativeDelayLoggingAndKeepingTheOldValue) 
     EXPECT_EQ(agent.getPasskeyDelay(), 2);
     EXPECT_EQ(agent.setPasskeyDelay(0), 0);
     EXPECT_EQ(agent.getPasskeyDelay(), 0);
-    EXPECT_EQ(log.lines(), (std::vector<std::string>{
-                               "agent.cpp:87 Failed to set null passkey value.",
-                               "agent.cpp:106 Failed to set negitive passkey delay." }));
-}
-
-TEST(AnAgent, KeepsTheCapabilityPointerAndRefusesNullSilently) {
-    LogCapture log;
-    Agent agent;
     char capability[] = "KeyboardOnly";
     EXPECT_EQ(agent.setCapability(capability), 0);
     EXPECT_EQ(agent.getCapability(), capability);  // not a copy
@@ -58,7 +50,9 @@ TEST(AnAgent, KeepsTheCapabilityPointerAndRefusesNullSilently) {
     EXPECT_EQ(agent.setDispatcher(nullptr), -1);
     agent.setReject(true);
     EXPECT_TRUE(agent.getReject());
-    EXPECT_TRUE(log.lines().empty());
+    EXPECT_EQ(log.lines(), (std::vector<std::string>{
+                               "agent.cpp:87 Failed to set null passkey value.",
+                               "agent.cpp:106 Failed to set negitive passkey delay." }));
 }
 
 TEST(AnAgent, BuildsItsPathFromThePidEvenWhenItCannotRegisterIt) {
@@ -78,53 +72,51 @@ MessagePtr call(const char* interface, const char* member) {
     return message;
 }
 
+// A request about a device, as bluetoothd sends it.
+MessagePtr request(const char* member) {
+    MessagePtr message = call("org.bluez.Agent", member);
+    const char* device = "/org/bluez/1/hci0/dev_00_11_22_33_44_55";
+    dbus_message_append_args(message.get(), DBUS_TYPE_OBJECT_PATH, &device, DBUS_TYPE_INVALID);
+    return message;
+}
+
 TEST(AnAgentsDispatcher, LogsTheRequestsWhoseArgumentsCannotBeReadAtTheirOwnLines) {
     struct Case {
         const char* member;
+        bool wrongTypes;  // a device and a text passkey, else no arguments
         DBusHandlerResult result;
         const char* line;
     };
     // deliberate asymmetry: only a PIN request counts bad arguments as handled.
     const std::vector<Case> cases = {
-        { "RequestPinCode", DBUS_HANDLER_RESULT_HANDLED,
+        { "RequestPinCode", false, DBUS_HANDLER_RESULT_HANDLED,
           "agent.cpp:167 Failed to get argument from request pin code message." },
-        { "RequestPasskey", DBUS_HANDLER_RESULT_NOT_YET_HANDLED,
+        { "RequestPasskey", false, DBUS_HANDLER_RESULT_NOT_YET_HANDLED,
           "agent.cpp:200 Failed to get argument from request passkey message." },
-        { "RequestConfirmation", DBUS_HANDLER_RESULT_NOT_YET_HANDLED,
+        { "RequestConfirmation", false, DBUS_HANDLER_RESULT_NOT_YET_HANDLED,
           "agent.cpp:252 Failed to get argument from request confirmation message." },
-        { "Authorize", DBUS_HANDLER_RESULT_NOT_YET_HANDLED,
+        { "RequestConfirmation", true, DBUS_HANDLER_RESULT_NOT_YET_HANDLED,
+          "agent.cpp:252 Failed to get argument from request confirmation message." },
+        { "Authorize", false, DBUS_HANDLER_RESULT_NOT_YET_HANDLED,
           "agent.cpp:293 Failed to get argument from authorize message." },
     };
+    const char* notANumber = "482913";
     Agent agent;
     for (const Case& c : cases) {
-        SCOPED_TRACE(c.member);
+        SCOPED_TRACE(std::string(c.member) + (c.wrongTypes ? " with a text passkey" : ""));
         LogCapture log;
-        MessagePtr message = call("org.bluez.Agent", c.member);
+        MessagePtr message = c.wrongTypes ? request(c.member) : call("org.bluez.Agent", c.member);
+        if (c.wrongTypes) dbus_message_append_args(message.get(), DBUS_TYPE_STRING, &notANumber, DBUS_TYPE_INVALID);
         EXPECT_EQ(Agent::handlerDispatcher(nullptr, message.get(), &agent), c.result);
         EXPECT_EQ(log.lines(), std::vector<std::string>{ c.line });
     }
 }
 
-TEST(AnAgentsDispatcher, ChecksTheArgumentTypesNotOnlyTheirNumber) {
-    LogCapture log;
-    Agent agent;
-    MessagePtr message = call("org.bluez.Agent", "RequestConfirmation");
-    const char* device = "/org/bluez/1/hci0/dev_00_11_22_33_44_55";
-    const char* notANumber = "482913";
-    dbus_message_append_args(message.get(), DBUS_TYPE_OBJECT_PATH, &device, DBUS_TYPE_STRING,
-                             &notANumber, DBUS_TYPE_INVALID);
-    EXPECT_EQ(Agent::handlerDispatcher(nullptr, message.get(), &agent),
-              DBUS_HANDLER_RESULT_NOT_YET_HANDLED);
-    EXPECT_EQ(log.count("agent.cpp:252 Failed to get argument from request confirmation message."), 1u);
-}
-
 TEST(AnAgentsDispatcher, AnswersWellFormedRequestsAndLeavesEveryOtherMessageUnhandled) {
     Agent agent;
-    const char* device = "/org/bluez/1/hci0/dev_00_11_22_33_44_55";
     {
         LogCapture log;
-        MessagePtr pin = call("org.bluez.Agent", "RequestPinCode");
-        dbus_message_append_args(pin.get(), DBUS_TYPE_OBJECT_PATH, &device, DBUS_TYPE_INVALID);
+        MessagePtr pin = request("RequestPinCode");
         EXPECT_EQ(Agent::handlerDispatcher(nullptr, pin.get(), &agent), DBUS_HANDLER_RESULT_HANDLED);
         MessagePtr cancel = call("org.bluez.Agent", "Cancel");
         EXPECT_EQ(Agent::handlerDispatcher(nullptr, cancel.get(), &agent), DBUS_HANDLER_RESULT_HANDLED);
@@ -154,36 +146,29 @@ TEST(AnAgentsDispatcher, AnswersWellFormedRequestsAndLeavesEveryOtherMessageUnha
     EXPECT_EQ(log.lines().size(), 2u);
 }
 
-TEST(AnAgentsHandlers, ReportAMessageThatCannotBeAnsweredAsNoReplyMessage) {
+TEST(AnAgentsHandlers, ReportAMessageThatCannotBeAnsweredAsNoReplyMessageAndKeepTheUndispatchedOnesResults) {
     LogCapture log;
     Agent agent;
     MessagePtr unsent(dbus_message_new_method_call(":1.1", "/a", "org.bluez.Agent", "Cancel"));
     EXPECT_EQ(Agent::cancel(nullptr, unsent.get(), &agent), DBUS_HANDLER_RESULT_NEED_MEMORY);
     agent.setReject(true);
     EXPECT_EQ(Agent::requestPasskey(nullptr, unsent.get(), &agent), DBUS_HANDLER_RESULT_NOT_YET_HANDLED);
-    MessagePtr passkey = call("org.bluez.Agent", "RequestPasskey");
-    const char* device = "/org/bluez/1/hci0/dev_00_11_22_33_44_55";
-    dbus_message_append_args(passkey.get(), DBUS_TYPE_OBJECT_PATH, &device, DBUS_TYPE_INVALID);
+    MessagePtr passkey = request("RequestPasskey");
     EXPECT_EQ(Agent::requestPasskey(nullptr, passkey.get(), &agent), DBUS_HANDLER_RESULT_HANDLED);
     dbus_message_set_serial(passkey.get(), 0);
     EXPECT_EQ(Agent::requestPasskey(nullptr, passkey.get(), &agent), DBUS_HANDLER_RESULT_NEED_MEMORY);
     agent.setReject(false);
     agent.setPasskeyValue("\xff");  // not UTF-8: cannot be sent as a PIN
-    MessagePtr pin = call("org.bluez.Agent", "RequestPinCode");
-    dbus_message_append_args(pin.get(), DBUS_TYPE_OBJECT_PATH, &device, DBUS_TYPE_INVALID);
+    MessagePtr pin = request("RequestPinCode");
     EXPECT_EQ(Agent::requestPinCode(nullptr, pin.get(), &agent), DBUS_HANDLER_RESULT_NEED_MEMORY);
     EXPECT_EQ(log.lines(), (std::vector<std::string>{
                                "agent.cpp:344 Failed to create reply message when handling cancel message.",
                                "agent.cpp:200 Failed to get argument from request passkey message.",
                                "agent.cpp:209 Failed to create reply message when handling request passkey message.",
                                "agent.cpp:173 Failed to create reply message when handling request pin code message." }));
-}
-
-TEST(AnAgent, KeepsTheUndispatchedHandlersResults) {
-    Agent agent;
-    MessagePtr message = call("org.bluez.Agent", "DisplayPasskey");
-    EXPECT_EQ(Agent::displayPasskey(nullptr, message.get(), &agent), DBUS_HANDLER_RESULT_NOT_YET_HANDLED);
-    EXPECT_EQ(Agent::confirmModeChange(nullptr, message.get(), &agent), DBUS_HANDLER_RESULT_HANDLED);
+    MessagePtr display = call("org.bluez.Agent", "DisplayPasskey");
+    EXPECT_EQ(Agent::displayPasskey(nullptr, display.get(), &agent), DBUS_HANDLER_RESULT_NOT_YET_HANDLED);
+    EXPECT_EQ(Agent::confirmModeChange(nullptr, display.get(), &agent), DBUS_HANDLER_RESULT_HANDLED);
 }
 
 }  // namespace
