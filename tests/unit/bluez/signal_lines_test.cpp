@@ -24,46 +24,43 @@ struct RestoreCout {
 };
 
 TEST(TheDefaultHandlers, PrintTheirLineWithTheRegisteringProxysPath) {
+    const std::string a = "/org/bluez/77/hci0", d = a + "/dev_00_11_22_33_44_55", s = a + "/dev_00_0D_3C_A1_B2_C3",
+                      c = a + "/dev_00_0D_3C_A1_B2_C4", address = "00:11:22:33:44:55";
     Manager manager;
-    Adapter adapter("/org/bluez/77/hci0");
-    Device device("/org/bluez/77/hci0/dev_00_11_22_33_44_55");
-    AudioSink sink("/org/bluez/77/hci0/dev_00_0D_3C_A1_B2_C3");
-    Control control("/org/bluez/77/hci0/dev_00_0D_3C_A1_B2_C4");
+    Adapter adapter(a.c_str());
+    Device device(d.c_str());
+    AudioSink sink(s.c_str());
+    Control control(c.c_str());
     const ObjectPath adapterPath("/org/bluez/77/hci1");
-    const ObjectPath devicePath("/org/bluez/77/hci0/dev_00_11_22_33_44_55");
+    const ObjectPath devicePath(d);
+    Dict properties = { Entry("Address", Variant(address)), Entry("RSSI", Variant(-52)) }, none;
     struct Case {
         std::function<void()> print;
         std::string line;
     };
     const std::vector<Case> cases = {
-        { [&] { Manager::adapterAddedHandler(&manager, &adapterPath); },
-          "/org/bluez/77/hci1 was added by /\n" },
-        { [&] { Manager::adapterRemovedHandler(&manager, &adapterPath); },
-          "/org/bluez/77/hci1 was removed by /\n" },
+        { [&] { Manager::adapterAddedHandler(&manager, &adapterPath); }, "/org/bluez/77/hci1 was added by /\n" },
+        { [&] { Manager::adapterRemovedHandler(&manager, &adapterPath); }, "/org/bluez/77/hci1 was removed by /\n" },
         { [&] { Manager::defaultAdapterChangedHandler(&manager, &adapterPath); },
           "Default adpater is /org/bluez/77/hci1 in / now\n" },
-        { [&] { Adapter::deviceDisappearedHandler(&adapter, "00:11:22:33:44:55"); },
-          "00:11:22:33:44:55 was disappeared in /org/bluez/77/hci0\n" },
-        { [&] { Adapter::deviceCreatedHandler(&adapter, &devicePath); },
-          "/org/bluez/77/hci0/dev_00_11_22_33_44_55 was created by /org/bluez/77/hci0\n" },
-        { [&] { Adapter::deviceRemovedHandler(&adapter, &devicePath); },
-          "/org/bluez/77/hci0/dev_00_11_22_33_44_55 was removed by /org/bluez/77/hci0\n" },
-        { [&] { Device::disconnectRequestedHandler(&device); },
-          "Disconnect requested from /org/bluez/77/hci0/dev_00_11_22_33_44_55\n" },
-        { [&] { AudioSink::connectedHandler(&sink); },
-          "Connected from /org/bluez/77/hci0/dev_00_0D_3C_A1_B2_C3\n" },
-        { [&] { AudioSink::disconnectedHandler(&sink); },
-          "Disconnected from /org/bluez/77/hci0/dev_00_0D_3C_A1_B2_C3\n" },
-        { [&] { AudioSink::playingHandler(&sink); },
-          "Playing in /org/bluez/77/hci0/dev_00_0D_3C_A1_B2_C3\n" },
-        { [&] { AudioSink::stoppedHandler(&sink); },
-          "Stopped in /org/bluez/77/hci0/dev_00_0D_3C_A1_B2_C3\n" },
-        { [&] { Control::connectedHandler(&control); },
-          "Connected from /org/bluez/77/hci0/dev_00_0D_3C_A1_B2_C4\n" },
-        { [&] { Control::disconnectedHandler(&control); },
-          "Disconnected from /org/bluez/77/hci0/dev_00_0D_3C_A1_B2_C4\n" },
+        { [&] { Adapter::deviceDisappearedHandler(&adapter, address.c_str()); },
+          address + " was disappeared in " + a + "\n" },
+        { [&] { Adapter::deviceCreatedHandler(&adapter, &devicePath); }, d + " was created by " + a + "\n" },
+        { [&] { Adapter::deviceRemovedHandler(&adapter, &devicePath); }, d + " was removed by " + a + "\n" },
+        // A found device on two lines, the second being its properties.
+        { [&] { Adapter::deviceFoundHandler(&adapter, address.c_str(), &properties); },
+          address + " was found by " + a + "\nAddress: " + address + "\nRSSI: -52\n\n" },
+        { [&] { Adapter::deviceFoundHandler(&adapter, address.c_str(), &none); },
+          address + " was found by " + a + "\n\n" },
+        { [&] { Device::disconnectRequestedHandler(&device); }, "Disconnect requested from " + d + "\n" },
+        { [&] { AudioSink::connectedHandler(&sink); }, "Connected from " + s + "\n" },
+        { [&] { AudioSink::disconnectedHandler(&sink); }, "Disconnected from " + s + "\n" },
+        { [&] { AudioSink::playingHandler(&sink); }, "Playing in " + s + "\n" },
+        { [&] { AudioSink::stoppedHandler(&sink); }, "Stopped in " + s + "\n" },
+        { [&] { Control::connectedHandler(&control); }, "Connected from " + c + "\n" },
+        { [&] { Control::disconnectedHandler(&control); }, "Disconnected from " + c + "\n" },
     };
-    for (const Case& c : cases) EXPECT_EQ(printed(c.print), c.line);
+    for (const Case& row : cases) EXPECT_EQ(printed(row.print), row.line);
 }
 
 TEST(TheDefaultHandlers, PrintAPropertyChangeWithTheValuesTextForm) {
@@ -84,18 +81,6 @@ TEST(TheDefaultHandlers, PrintAPropertyChangeWithTheValuesTextForm) {
         EXPECT_EQ(printed([&] { BluezObject::propertyChangedHandler(&device, c.name, &c.value); }),
                   std::string(c.name) + " was changed in /org/bluez/77/hci0/dev_00_11_22_33_44_55 with " +
                       c.text + "\n");
-}
-
-TEST(TheDefaultHandlers, PrintAFoundDeviceOnTwoLinesTheSecondBeingItsProperties) {
-    Adapter adapter("/org/bluez/77/hci0");
-    Dict properties = { Entry("Address", Variant(std::string("00:11:22:33:44:55"))),
-                        Entry("RSSI", Variant(-52)) };
-    EXPECT_EQ(printed([&] { Adapter::deviceFoundHandler(&adapter, "00:11:22:33:44:55", &properties); }),
-              "00:11:22:33:44:55 was found by /org/bluez/77/hci0\n"
-              "Address: 00:11:22:33:44:55\nRSSI: -52\n\n");
-    Dict none;
-    EXPECT_EQ(printed([&] { Adapter::deviceFoundHandler(&adapter, "00:11:22:33:44:55", &none); }),
-              "00:11:22:33:44:55 was found by /org/bluez/77/hci0\n\n");
 }
 
 TEST(TheDefaultHandlers, LoseTheRestOfTheLineAfterANullPieceWithoutCrashing) {
