@@ -39,63 +39,47 @@ TEST(AProxyWithoutABus, FailsEveryOperationAndLogsItOnceAtItsOwnLine) {
     Agent agent;
     const Variant on(true);
     bool connected = true;
-    std::unique_ptr<Manager> manager(new Manager);
-    std::unique_ptr<Adapter> adapter(new Adapter(kAdapterPath));
-    std::unique_ptr<Device> device(new Device(kDevicePath));
-    std::unique_ptr<Audio> audio(new Audio(kDevicePath));
-    std::unique_ptr<AudioSink> sink(new AudioSink(kDevicePath));
-    std::unique_ptr<Control> control(new Control(kDevicePath));
+    Manager manager;
+    Adapter adapter(kAdapterPath);
+    Device device(kDevicePath);
+    Audio audio(kDevicePath);
+    AudioSink sink(kDevicePath);
+    Control control(kDevicePath);
     const std::vector<Case> cases = {
-        { "getProperties", device.get(), [&] { return device->getProperties() == nullptr; },
-          "bluez_object.cpp:77 " },
-        { "setProperty", device.get(), [&] { return device->setProperty("Trusted", on) == -1; },
-          "bluez_object.cpp:107 " },
-        { "defaultAdapter", manager.get(), [&] { return manager->defaultAdapter() == nullptr; },
-          "manager.cpp:96 " },
-        { "findAdapter", manager.get(), [&] { return manager->findAdapter("hci0") == nullptr; },
-          "manager.cpp:156 " },
-        { "getAdapterByIndex", manager.get(), [&] { return manager->getAdapterByIndex(0) == nullptr; },
+        { "getProperties", &device, [&] { return device.getProperties() == nullptr; }, "bluez_object.cpp:77 " },
+        { "setProperty", &device, [&] { return device.setProperty("Trusted", on) == -1; }, "bluez_object.cpp:107 " },
+        { "defaultAdapter", &manager, [&] { return manager.defaultAdapter() == nullptr; }, "manager.cpp:96 " },
+        { "findAdapter", &manager, [&] { return manager.findAdapter("hci0") == nullptr; }, "manager.cpp:156 " },
+        { "getAdapterByIndex", &manager, [&] { return manager.getAdapterByIndex(0) == nullptr; },
           "manager.cpp:126 " },
-        { "listAdapters", manager.get(), [&] { return manager->listAdapters() == nullptr; }, "" },
-        { "requestSession", adapter.get(), [&] { return adapter->requestSession() == -1; },
-          "adapter.cpp:83 " },
-        { "releaseSession", adapter.get(), [&] { return adapter->releaseSession() == -1; },
-          "adapter.cpp:105 " },
-        { "startDiscovery", adapter.get(), [&] { return adapter->startDiscovery() == -1; },
-          "adapter.cpp:127 " },
-        { "stopDiscovery", adapter.get(), [&] { return adapter->stopDiscovery() == -1; },
-          "adapter.cpp:149 " },
-        { "findDevice logged", adapter.get(), [&] { return adapter->findDevice("00:11:22:33:44:55", true) == nullptr; },
+        { "listAdapters", &manager, [&] { return manager.listAdapters() == nullptr; }, "" },
+        { "requestSession", &adapter, [&] { return adapter.requestSession() == -1; }, "adapter.cpp:83 " },
+        { "releaseSession", &adapter, [&] { return adapter.releaseSession() == -1; }, "adapter.cpp:105 " },
+        { "startDiscovery", &adapter, [&] { return adapter.startDiscovery() == -1; }, "adapter.cpp:127 " },
+        { "stopDiscovery", &adapter, [&] { return adapter.stopDiscovery() == -1; }, "adapter.cpp:149 " },
+        { "findDevice logged", &adapter, [&] { return adapter.findDevice("00:11:22:33:44:55", true) == nullptr; },
           "adapter.cpp:180 " },
-        { "findDevice quiet", adapter.get(), [&] { return adapter->findDevice("00:11:22:33:44:55", false) == nullptr; },
+        { "findDevice quiet", &adapter, [&] { return adapter.findDevice("00:11:22:33:44:55", false) == nullptr; },
           "" },
-        { "listDevices", adapter.get(), [&] { return adapter->listDevices() == nullptr; },
-          "adapter.cpp:212 " },
-        { "getDeviceByIndex", adapter.get(), [&] { return adapter->getDeviceByIndex(0) == nullptr; },
-          "adapter.cpp:243 " },
-        { "createDevice", adapter.get(), [&] { return adapter->createDevice("00:11:22:33:44:55") == nullptr; },
+        { "listDevices", &adapter, [&] { return adapter.listDevices() == nullptr; }, "adapter.cpp:212 " },
+        { "getDeviceByIndex", &adapter, [&] { return adapter.getDeviceByIndex(0) == nullptr; }, "adapter.cpp:243 " },
+        { "createDevice", &adapter, [&] { return adapter.createDevice("00:11:22:33:44:55") == nullptr; },
           "adapter.cpp:274 " },
-        { "cancelDeviceCreation", adapter.get(), [&] { return adapter->cancelDeviceCreation("00:11:22:33:44:55") == -1; },
+        { "cancelDeviceCreation", &adapter, [&] { return adapter.cancelDeviceCreation("00:11:22:33:44:55") == -1; },
           "adapter.cpp:337 " },
-        { "removeDevice", adapter.get(), [&] { return adapter->removeDevice(kDevicePath) == -1; },
-          "adapter.cpp:363 " },
-        { "adapter getProperties", adapter.get(), [&] { return adapter->getProperties() == nullptr; },
+        { "removeDevice", &adapter, [&] { return adapter.removeDevice(kDevicePath) == -1; }, "adapter.cpp:363 " },
+        { "adapter getProperties", &adapter, [&] { return adapter.getProperties() == nullptr; },
           "bluez_object.cpp:77 " },
-        { "discoverServices", device.get(), [&] { return device->discoverServices("") == nullptr; },
-          "device.cpp:64 " },
-        { "cancelDiscovery", device.get(), [&] { return device->cancelDiscovery() == -1; },
-          "device.cpp:85 " },
-        { "Audio::connect", audio.get(), [&] { return audio->connect() == -1; }, "audio.cpp:51 " },
-        { "Audio::disconnect", audio.get(), [&] { return audio->disconnect() == -1; }, "audio.cpp:73 " },
-        { "AudioSink::connect", sink.get(), [&] { return sink->connect() == -1; }, "audio_sink.cpp:58 " },
-        { "AudioSink::disconnect", sink.get(), [&] { return sink->disconnect() == -1; },
-          "audio_sink.cpp:80 " },
-        { "AudioSink::isConnected", sink.get(), [&] { return sink->isConnected(connected) == -1; },
-          "audio_sink.cpp:106 " },
-        { "Control::isConnected", control.get(), [&] { return control->isConnected(connected) == -1; },
-          "control.cpp:60 " },
-        { "volumeDown", control.get(), [&] { return control->volumeDown() == -1; }, "control.cpp:82 " },
-        { "volumeUp", control.get(), [&] { return control->volumeUp() == -1; }, "control.cpp:105 " },
+        { "discoverServices", &device, [&] { return device.discoverServices("") == nullptr; }, "device.cpp:64 " },
+        { "cancelDiscovery", &device, [&] { return device.cancelDiscovery() == -1; }, "device.cpp:85 " },
+        { "Audio::connect", &audio, [&] { return audio.connect() == -1; }, "audio.cpp:51 " },
+        { "Audio::disconnect", &audio, [&] { return audio.disconnect() == -1; }, "audio.cpp:73 " },
+        { "AudioSink::connect", &sink, [&] { return sink.connect() == -1; }, "audio_sink.cpp:58 " },
+        { "AudioSink::disconnect", &sink, [&] { return sink.disconnect() == -1; }, "audio_sink.cpp:80 " },
+        { "AudioSink::isConnected", &sink, [&] { return sink.isConnected(connected) == -1; }, "audio_sink.cpp:106 " },
+        { "Control::isConnected", &control, [&] { return control.isConnected(connected) == -1; }, "control.cpp:60 " },
+        { "volumeDown", &control, [&] { return control.volumeDown() == -1; }, "control.cpp:82 " },
+        { "volumeUp", &control, [&] { return control.volumeUp() == -1; }, "control.cpp:105 " },
     };
     for (const Case& c : cases) {
         SCOPED_TRACE(c.name);
