@@ -45,14 +45,21 @@ inline std::unique_ptr<Bluetooth::RemoteObject> peerObject(const char* path = kP
     return std::make_unique<Bluetooth::RemoteObject>(kPeerName, path, kPeerInterface, DBUS_BUS_SESSION);
 }
 
-// Calls method with string arguments and waits for the reply; fails the test
-// if it cannot be sent.
+// Builds a call of method with args, not yet sent; fails the test if an
+// argument cannot be written.
 template <typename... A>
-void callPeer(Bluetooth::RemoteObject& peer, const char* method, const A&... args) {
+void buildCall(Bluetooth::RemoteObject& peer, const char* method, const A&... args) {
     ASSERT_EQ(peer.newMessage(method), 0);
     int failed = 0;
     ((failed += peer.append(args) != 0), ...);
     ASSERT_EQ(failed, 0) << method << ": " << peer.getErrorMessage();
+}
+
+// Calls method with args and waits for the reply; fails the test if it cannot
+// be sent.
+template <typename... A>
+void callPeer(Bluetooth::RemoteObject& peer, const char* method, const A&... args) {
+    ASSERT_NO_FATAL_FAILURE(buildCall(peer, method, args...));
     ASSERT_EQ(peer.sendMessage(true, -1), 0) << method << ": " << peer.getErrorMessage();
 }
 

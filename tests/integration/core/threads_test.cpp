@@ -223,16 +223,6 @@ TEST_F(BlockingCalls, AreNotHeldUpByAHandlerOfAnotherBusWaitingOnTheirs) {
     dbus_connection_unref(newcomer);
 }
 
-TEST_F(BlockingCalls, ReportTheDBusErrorNameBesideItsText) {
-    ASSERT_EQ(peer->newMessage("Fail"), 0);
-    EXPECT_EQ(peer->sendMessage(true, -1), -1);
-    EXPECT_EQ(peer->getErrorNumber(), 11);
-    EXPECT_EQ(peer->getErrorMessage(), "peer says no");
-    EXPECT_EQ(peer->getErrorName(), "org.btbus.Error.Failed");
-    peer->resetError();
-    EXPECT_EQ(peer->getErrorName(), "");
-}
-
 std::string gInDispatchError;
 DBusHandlerResult callFromObjectPath(DBusConnection* connection, DBusMessage* message, void*) {
     auto object = peerObject();
