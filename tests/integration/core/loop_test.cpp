@@ -13,17 +13,7 @@ namespace {
 std::atomic<unsigned> gTicks{ 0 };
 void onTick(RemoteObject*, const char*) { ++gTicks; }
 
-class LoopTest : public ::testing::Test {
-protected:
-    void SetUp() override {
-        Peer::ensureStarted();
-        loopOwner();
-        peer = peerObject();
-    }
-    std::unique_ptr<RemoteObject> peer;
-};
-
-using TheReceivingThreadBesideCalls = LoopTest;
+using TheReceivingThreadBesideCalls = PeerWithLoopTest;
 
 TEST_F(TheReceivingThreadBesideCalls, LetsEveryBlockingCallHaveItsReplyWhileSignalsPourIn) {
     ASSERT_EQ(peer->setSignalHandlerString("Tick", &onTick), 0);

@@ -1,8 +1,6 @@
 // Signals from a real peer through the receiving thread: the five signatures,
 // matching without the path, malformed arguments, and removal on destruction.
 #include <atomic>
-#include <functional>
-#include <map>
 #include <mutex>
 
 #include <gtest/gtest.h>
@@ -55,16 +53,21 @@ void onDict(RemoteObject* object, const char* name, const Dict* dict) {
 }
 void onBare(RemoteObject* object) { note(std::string("bare ") + object->getPath()); }
 
-class SignalTest : public ::testing::Test {
+// Registers the handler above that fits member's signature; any other member has no arguments.
+int listen(RemoteObject& object, const std::string& member) {
+    if (member == "PathSignal") return object.setSignalHandlerObjectPath(member.c_str(), &onPath);
+    if (member == "StringSignal") return object.setSignalHandlerString(member.c_str(), &onString);
+    if (member == "PropertyChanged") return object.setSignalHandlerStringVariant(member.c_str(), &onVariant);
+    if (member == "DictSignal") return object.setSignalHandlerStringDict(member.c_str(), &onDict);
+    return object.setSignalHandlerNoArgument(member.c_str(), &onBare);
+}
+
+class SignalTest : public PeerWithLoopTest {
 protected:
     void SetUp() override {
-        Peer::ensureStarted();
-        loopOwner();
-        peer = peerObject();
+        PeerWithLoopTest::SetUp();
         clearEvents();
     }
-
-    void emit(const char* kind) { callPeer(*peer, "Emit", kind); }
 
     bool waitFor(const std::string& event) {
         return waitUntil([&] {
@@ -83,7 +86,6 @@ protected:
         ASSERT_TRUE(waitFor(std::string("string ") + sentinelOwner.getPath() + " done"));
     }
 
-    std::unique_ptr<RemoteObject> peer;
     LogCapture log;
 };
 
@@ -91,11 +93,8 @@ using TheReceivingThread = SignalTest;
 
 TEST_F(TheReceivingThread, DeliversEachSignatureToItsHandlersAndDictionariesUpToAnEmptyName) {
     auto object = peerObject();
-    ASSERT_EQ(object->setSignalHandlerObjectPath("PathSignal", &onPath), 0);
-    ASSERT_EQ(object->setSignalHandlerString("StringSignal", &onString), 0);
-    ASSERT_EQ(object->setSignalHandlerStringVariant("PropertyChanged", &onVariant), 0);
-    ASSERT_EQ(object->setSignalHandlerStringDict("DictSignal", &onDict), 0);
-    ASSERT_EQ(object->setSignalHandlerNoArgument("Bare", &onBare), 0);
+    for (const char* member : { "PathSignal", "StringSignal", "PropertyChanged", "DictSignal", "Bare" })
+        ASSERT_EQ(listen(*object, member), 0) << member;
     const struct {
         const char* kind;
         const char* event;
@@ -184,12 +183,6 @@ TEST_F(TheReceivingThread, LogsAMalformedSignalOnceAndStillOffersItToTheOtherLis
         { "dict-byte", "DictSignal", "Failed to parse entry value", 4 },
         { "dict-bytekeys", "DictSignal", "Failed to parse entry name", 4 },
     };
-    std::map<std::string, std::function<int(RemoteObject&)>> registerFor = {
-        { "PropertyChanged", [](RemoteObject& o) { return o.setSignalHandlerStringVariant("PropertyChanged", &onVariant); } },
-        { "StringSignal", [](RemoteObject& o) { return o.setSignalHandlerString("StringSignal", &onString); } },
-        { "PathSignal", [](RemoteObject& o) { return o.setSignalHandlerObjectPath("PathSignal", &onPath); } },
-        { "DictSignal", [](RemoteObject& o) { return o.setSignalHandlerStringDict("DictSignal", &onDict); } },
-    };
     for (const Malformed& c : cases) {
         SCOPED_TRACE(c.kind);
         clearEvents();
@@ -198,8 +191,8 @@ TEST_F(TheReceivingThread, LogsAMalformedSignalOnceAndStillOffersItToTheOtherLis
         // The first object's match rules are the ones that bring the signal here.
         auto first = peerObject();
         auto second = peerObject("/org/btbus/Second");
-        ASSERT_EQ(registerFor[c.member](*first), 0);
-        ASSERT_EQ(registerFor[c.member](*second), 0);
+        ASSERT_EQ(listen(*first, c.member), 0);
+        ASSERT_EQ(listen(*second, c.member), 0);
         ASSERT_EQ(first->setSignalHandlerNoArgument(c.member, &onBare), 0);
         auto sentinel = peerObject();
         emit(c.kind);
