@@ -13,17 +13,7 @@ namespace {
 std::atomic<unsigned> gTicks{ 0 };
 void onTick(RemoteObject*, const char*) { ++gTicks; }
 
-class LoopTest : public ::testing::Test {
-protected:
-    void SetUp() override {
-        Peer::ensureStarted();
-        loopOwner();
-        peer = peerObject();
-    }
-    std::unique_ptr<RemoteObject> peer;
-};
-
-using TheReceivingThreadBesideCalls = LoopTest;
+using TheReceivingThreadBesideCalls = PeerWithLoopTest;
 
 TEST_F(TheReceivingThreadBesideCalls, LetsEveryBlockingCallHaveItsReplyWhileSignalsPourIn) {
     ASSERT_EQ(peer->setSignalHandlerString("Tick", &onTick), 0);
@@ -51,9 +41,7 @@ TEST_F(TheReceivingThreadBesideCalls, AnswersACallBackThatABlockingCallWaitsFor)
     ServedPath served(*peer);
     // The peer calls this process back before it answers: the answer can only
     // be written while the blocking call waits, by the receiving thread.
-    ASSERT_EQ(peer->newMessage("CallBack"), 0);
-    ASSERT_EQ(peer->append(peer->getConnectionName()), 0);
-    ASSERT_EQ(peer->append(ObjectPath(ServedPath::kPath)), 0);
+    buildCall(*peer, "CallBack", peer->getConnectionName(), ObjectPath(ServedPath::kPath));
     ASSERT_EQ(peer->sendMessage(true, 5000), 0) << peer->getErrorMessage();
     std::string answer;
     EXPECT_EQ(peer->getReplyValue(answer), 0);
@@ -63,8 +51,7 @@ TEST_F(TheReceivingThreadBesideCalls, AnswersACallBackThatABlockingCallWaitsFor)
 }
 
 TEST_F(TheReceivingThreadBesideCalls, TimesOutABlockingCallThatGetsNoReply) {
-    ASSERT_EQ(peer->newMessage("Sleep"), 0);
-    ASSERT_EQ(peer->append(1000u), 0);
+    buildCall(*peer, "Sleep", 1000u);
     EXPECT_EQ(peer->sendMessage(true, 200), -1);
     EXPECT_EQ(peer->getErrorNumber(), 11);
     EXPECT_NE(peer->getErrorMessage().find("reply"), std::string::npos) << peer->getErrorMessage();

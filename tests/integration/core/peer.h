@@ -45,14 +45,21 @@ inline std::unique_ptr<Bluetooth::RemoteObject> peerObject(const char* path = kP
     return std::make_unique<Bluetooth::RemoteObject>(kPeerName, path, kPeerInterface, DBUS_BUS_SESSION);
 }
 
-// Calls method with string arguments and waits for the reply; fails the test
-// if it cannot be sent.
+// Builds a call of method with args, not yet sent; fails the test if an
+// argument cannot be written.
 template <typename... A>
-void callPeer(Bluetooth::RemoteObject& peer, const char* method, const A&... args) {
+void buildCall(Bluetooth::RemoteObject& peer, const char* method, const A&... args) {
     ASSERT_EQ(peer.newMessage(method), 0);
     int failed = 0;
     ((failed += peer.append(args) != 0), ...);
     ASSERT_EQ(failed, 0) << method << ": " << peer.getErrorMessage();
+}
+
+// Calls method with args and waits for the reply; fails the test if it cannot
+// be sent.
+template <typename... A>
+void callPeer(Bluetooth::RemoteObject& peer, const char* method, const A&... args) {
+    ASSERT_NO_FATAL_FAILURE(buildCall(peer, method, args...));
     ASSERT_EQ(peer.sendMessage(true, -1), 0) << method << ": " << peer.getErrorMessage();
 }
 
@@ -83,6 +90,26 @@ inline Bluetooth::RemoteObject& loopOwner() {
     return *gLoopOwner;
 }
 
+// A test against the peer with this binary's receiving thread running.
+class PeerWithLoopTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        Peer::ensureStarted();
+        loopOwner();
+        peer = peerObject();
+    }
+    void emit(const char* kind) { callPeer(*peer, "Emit", kind); }
+    std::unique_ptr<Bluetooth::RemoteObject> peer;
+};
+
+// Answers call with one string.
+inline void replyWith(DBusConnection* connection, DBusMessage* call, const char* text) {
+    DBusMessage* reply = dbus_message_new_method_return(call);
+    dbus_message_append_args(reply, DBUS_TYPE_STRING, &text, DBUS_TYPE_INVALID);
+    dbus_connection_send(connection, reply, nullptr);
+    dbus_message_unref(reply);
+}
+
 // Answers org.btbus.Callback.Ping with "pong: <word>" and notes the thread.
 struct CallbackState {
     std::atomic<std::thread::id> thread{};
@@ -97,21 +124,18 @@ inline DBusHandlerResult answerPing(DBusConnection* connection, DBusMessage* mes
     ++state->calls;
     const char* word = nullptr;
     dbus_message_get_args(message, nullptr, DBUS_TYPE_STRING, &word, DBUS_TYPE_INVALID);
-    std::string answer = std::string("pong: ") + (word ? word : "");
-    const char* text = answer.c_str();
-    DBusMessage* reply = dbus_message_new_method_return(message);
-    dbus_message_append_args(reply, DBUS_TYPE_STRING, &text, DBUS_TYPE_INVALID);
-    dbus_connection_send(connection, reply, nullptr);
+    replyWith(connection, message, (std::string("pong: ") + (word ? word : "")).c_str());
     dbus_connection_flush(connection);  // as the agent does
-    dbus_message_unref(reply);
     return DBUS_HANDLER_RESULT_HANDLED;
 }
 
-// An object path served on the shared session connection, as an agent is.
+// An object path served on the shared session connection, as an agent is;
+// answerPing by default.
 class ServedPath {
 public:
-    explicit ServedPath(Bluetooth::RemoteObject& on) : connection_(on.getConnection()) {
-        vtable_.message_function = &answerPing;
+    explicit ServedPath(Bluetooth::RemoteObject& on, DBusObjectPathMessageFunction answer = &answerPing)
+        : connection_(on.getConnection()) {
+        vtable_.message_function = answer;
         EXPECT_TRUE(dbus_connection_register_object_path(connection_, kPath, &vtable_, &state));
     }
     ~ServedPath() { dbus_connection_unregister_object_path(connection_, kPath); }

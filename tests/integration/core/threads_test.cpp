@@ -37,11 +37,7 @@ public:
             std::this_thread::sleep_for(delay);
             std::lock_guard<std::mutex> hold(lock_);
             for (DBusMessage* call : calls_) {
-                DBusMessage* reply = dbus_message_new_method_return(call);
-                const char* text = "late";
-                dbus_message_append_args(reply, DBUS_TYPE_STRING, &text, DBUS_TYPE_INVALID);
-                dbus_connection_send(connection_, reply, nullptr);
-                dbus_message_unref(reply);
+                replyWith(connection_, call, "late");
                 dbus_message_unref(call);
             }
             calls_.clear();
@@ -95,16 +91,12 @@ void deleteSelf(RemoteObject*, const char*) {
     delete gSelf.exchange(nullptr);
 }
 
-class ThreadTest : public ::testing::Test {
+class ThreadTest : public PeerWithLoopTest {
 protected:
     void SetUp() override {
-        Peer::ensureStarted();
-        loopOwner();
-        peer = peerObject();
+        PeerWithLoopTest::SetUp();
         gCalls = 0;
     }
-    void emit(const char* kind) { callPeer(*peer, "Emit", kind); }
-    std::unique_ptr<RemoteObject> peer;
 };
 
 using Handlers = ThreadTest;
@@ -223,16 +215,6 @@ TEST_F(BlockingCalls, AreNotHeldUpByAHandlerOfAnotherBusWaitingOnTheirs) {
     dbus_connection_unref(newcomer);
 }
 
-TEST_F(BlockingCalls, ReportTheDBusErrorNameBesideItsText) {
-    ASSERT_EQ(peer->newMessage("Fail"), 0);
-    EXPECT_EQ(peer->sendMessage(true, -1), -1);
-    EXPECT_EQ(peer->getErrorNumber(), 11);
-    EXPECT_EQ(peer->getErrorMessage(), "peer says no");
-    EXPECT_EQ(peer->getErrorName(), "org.btbus.Error.Failed");
-    peer->resetError();
-    EXPECT_EQ(peer->getErrorName(), "");
-}
-
 std::string gInDispatchError;
 DBusHandlerResult callFromObjectPath(DBusConnection* connection, DBusMessage* message, void*) {
     auto object = peerObject();
@@ -240,21 +222,13 @@ DBusHandlerResult callFromObjectPath(DBusConnection* connection, DBusMessage* me
     object->append("inside");
     object->sendMessage(true, -1);
     gInDispatchError = object->getErrorName();
-    DBusMessage* reply = dbus_message_new_method_return(message);
-    const char* text = "pong";
-    dbus_message_append_args(reply, DBUS_TYPE_STRING, &text, DBUS_TYPE_INVALID);
-    dbus_connection_send(connection, reply, nullptr);
-    dbus_message_unref(reply);
+    replyWith(connection, message, "pong");
     return DBUS_HANDLER_RESULT_HANDLED;
 }
 
 TEST_F(BlockingCalls, FailAtOnceInsideAnObjectPathOfTheirOwnConnection) {
-    DBusObjectPathVTable vtable{};
-    vtable.message_function = &callFromObjectPath;
-    DBusConnection* connection = peer->getConnection();
-    ASSERT_TRUE(dbus_connection_register_object_path(connection, "/org/btbus/Callback", &vtable, nullptr));
-    callPeer(*peer, "CallBack", peer->getConnectionName(), ObjectPath("/org/btbus/Callback"));
-    dbus_connection_unregister_object_path(connection, "/org/btbus/Callback");
+    ServedPath served(*peer, &callFromObjectPath);
+    callPeer(*peer, "CallBack", peer->getConnectionName(), ObjectPath(ServedPath::kPath));
     // At once, not libdbus's time-out: the wait would never end there.
     EXPECT_EQ(gInDispatchError, "org.freedesktop.DBus.Error.Failed");
 }

@@ -58,9 +58,8 @@ TEST_F(AScanner, StartsTheServiceAndListsDevicesWithTextAsDictsOfStrings) {
     EXPECT_TRUE(none->empty());  // the answer's one entry "" to "" holds no separator
     EXPECT_TRUE(scannerRuns());
     const std::string address = "00:11:22:33:44:55", silent = "00:11:22:33:44:66";
-    sim::emitSignal(hci1, "org.bluez.Adapter", "DeviceFound", "sa{sv}",
-                    "[\"" + address + "\", {\"Address\": [\"s\", \"" + address + "\"], \"RSSI\": [\"n\", -60]}]");
-    sim::emitSignal(hci1, "org.bluez.Adapter", "DeviceFound", "sa{sv}", "[\"" + silent + "\", {}]");
+    found(hci1, address, R"({"Address": ["s", ")" + address + R"("], "RSSI": ["n", -60]})");
+    found(hci1, silent, "{}");
     ASSERT_TRUE(waitUntil([&] { return callScanner("ListDevices", "hci1").devices.count(silent) == 1; }, 10s));
     Devices devices(scanner.listDevices("hci1", true));
     ASSERT_NE(devices, nullptr);

@@ -11,6 +11,7 @@
 
 #include "core/dbus_holders.h"
 #include "support/process.h"
+#include "support/sim.h"
 
 namespace btbus_test {
 
@@ -83,6 +84,12 @@ inline Answer callScanner(const char* method, const std::string& argument) {
         }
     }
     return answer;
+}
+
+// DeviceFound from adapterPath; props is the a{sv} as the simulator's JSON.
+inline void found(const std::string& adapterPath, const std::string& address, const std::string& props) {
+    sim::emitSignal(adapterPath, "org.bluez.Adapter", "DeviceFound", "sa{sv}",
+                    "[\"" + address + "\", " + props + "]");
 }
 
 // Standard output and error of a shell command.

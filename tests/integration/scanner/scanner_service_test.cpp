@@ -20,12 +20,6 @@ using Devices = std::map<std::string, std::string>;
 
 const char kAddress[] = "00:11:22:33:44:55";
 
-// DeviceFound from adapterPath; props is the a{sv} as the simulator's JSON.
-void found(const std::string& adapterPath, const std::string& address, const std::string& props) {
-    sim::emitSignal(adapterPath, "org.bluez.Adapter", "DeviceFound", "sa{sv}",
-                    "[\"" + address + "\", " + props + "]");
-}
-
 std::set<std::string> addresses(const Devices& devices) {
     std::set<std::string> keys;
     for (const auto& device : devices) keys.insert(device.first);
@@ -165,20 +159,17 @@ TEST_F(AScannerDaemon, SurvivesBadSignalsVanishingClientsAndAStormBesideEightCli
     std::string hci1 = sim::addAdapter("hci1", "00:1A:7D:DA:71:99");
     ASSERT_EQ(callScanner("ListDevices", "hci1").error, "");
     const std::string longText(10000, 'x');
-    const std::string bad[][2] = {
-        { "DeviceFound", R"(["A1", {"Address": ["d", 1.5]}])" },
-        { "DeviceFound", R"(["A2", {"Nested": ["a{sv}", {"x": ["s", "y"]}], "Big": ["x", 5]}])" },
-        { "DeviceFound", R"(["", {"Address": ["s", ""]}])" },
-        { "DeviceFound", "[\"" + longText + "\", {\"Name\": [\"s\", \"long address\"]}]" },
-        { "DeviceFound", "[\"A3\", {\"Name\": [\"s\", \"" + longText + "\"]}]" },
-        { "DeviceDisappeared", R"([""])" },
+    const std::string bad[][3] = {  // member, signature, arguments
+        { "DeviceFound", "sa{sv}", R"(["A1", {"Address": ["d", 1.5]}])" },
+        { "DeviceFound", "sa{sv}", R"(["A2", {"Nested": ["a{sv}", {"x": ["s", "y"]}], "Big": ["x", 5]}])" },
+        { "DeviceFound", "sa{sv}", R"(["", {"Address": ["s", ""]}])" },
+        { "DeviceFound", "sa{sv}", "[\"" + longText + "\", {\"Name\": [\"s\", \"long address\"]}]" },
+        { "DeviceFound", "sa{sv}", "[\"A3\", {\"Name\": [\"s\", \"" + longText + "\"]}]" },
+        { "DeviceDisappeared", "s", R"([""])" },
+        { "DeviceFound", "ia{sv}", R"([7, {}])" },
+        { "DeviceFound", "s", R"(["A4"])" },
     };
-    for (const auto& signal : bad) {
-        std::string signature = signal[0] == "DeviceFound" ? "sa{sv}" : "s";
-        sim::emitSignal(hci1, "org.bluez.Adapter", signal[0], signature, signal[1]);
-    }
-    sim::emitSignal(hci1, "org.bluez.Adapter", "DeviceFound", "ia{sv}", R"([7, {}])");
-    sim::emitSignal(hci1, "org.bluez.Adapter", "DeviceFound", "s", R"(["A4"])");
+    for (const auto& signal : bad) sim::emitSignal(hci1, "org.bluez.Adapter", signal[0], signal[1], signal[2]);
     // A1 and A2 cannot be decoded, "" is no address: only the others are kept.
     EXPECT_TRUE(listsExactly("hci1", { "A3", longText }));
     EXPECT_EQ(callScanner("ListDevices", "hci1").devices["A3"], "Name: " + longText + ";");

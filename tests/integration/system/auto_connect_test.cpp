@@ -84,6 +84,7 @@ Operation set(const char* adapter, bool on, const char* list) {
     return [=](AutoConnect& c) { return c.set(adapter, on, list); };
 }
 Operation remove(const char* device) { return [=](AutoConnect& c) { return c.removeDevice(kAdapter, device); }; }
+Operation send(bool (AutoConnect::*command)() const) { return [=](AutoConnect& c) { return (c.*command)(); }; }
 
 TEST_F(AutoConnectFiles, HoldTheFlagAndTheListAndTellTheDaemon) {
     BTBUS_IN_PRIVATE_NAMESPACE();
@@ -117,6 +118,9 @@ TEST_F(AutoConnectFiles, HoldTheFlagAndTheListAndTellTheDaemon) {
         { "1,A", set("../x", true, ""), false, "1,A", "", { "Adapter address '../x' is not a file name." } },
         { "<directory>", set(kAdapter, true, ",A"), false, "<directory>", "", { notRegular } },
         { "<link>", enabled(kAdapter), false, "<link>", "", { notRegular } },
+        { "1,A", send(&AutoConnect::reload), true, "1,A", "1", {} },
+        { "1,A", send(&AutoConnect::pause), true, "1,A", "pause", {} },
+        { "1,A", send(&AutoConnect::resume), true, "1,A", "resume", {} },
     };
     PipeReader daemon;
     for (const auto& row : kCases) {
@@ -152,20 +156,12 @@ TEST_F(AutoConnectFiles, KeepTheOldListWhenTheDiskIsFull) {
 
 TEST_F(AutoConnectFiles, SendCommandsOnlyToADaemonThatReads) {
     BTBUS_IN_PRIVATE_NAMESPACE();
-    const struct {
-        const char* bytes;
-        bool (AutoConnect::*send)() const;
-    } kCommands[] = { { "1", &AutoConnect::reload }, { "pause", &AutoConnect::pause }, { "resume", &AutoConnect::resume } };
-    {
-        PipeReader daemon;
-        for (const auto& command : kCommands) {
-            EXPECT_TRUE((config.*command.send)());
-            EXPECT_EQ(daemon.take(), command.bytes);
-        }
-    }
+    mkfifo(kPipe, 0666);  // nobody reads it
     LogCapture log;
     auto start = std::chrono::steady_clock::now();
-    for (const auto& command : kCommands) EXPECT_FALSE((config.*command.send)());
+    EXPECT_FALSE(config.reload());
+    EXPECT_FALSE(config.pause());
+    EXPECT_FALSE(config.resume());
     EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(1));
     EXPECT_EQ(log.from("fifo.cpp"), Lines(3, std::string("Error opening the named file ") + kPipe + ", errno is 6."));
     EXPECT_TRUE(config.set(kAdapter, true, ",A"));  // the file still counts

@@ -14,6 +14,15 @@ std::unique_ptr<Dict> divide(const std::string& input, const std::string& separa
     return std::unique_ptr<Dict>(stringDivideToDict(input, separators));
 }
 
+// The entries as name=value; with # before a value that is not a string; "null" for none.
+std::string described(const Dict* dict) {
+    if (dict == nullptr) return "null";
+    std::string entries;
+    for (const Entry& entry : *dict)
+        entries += entry.first + (entry.second.which() == 3 ? "=" : "=#") + variantToString(entry.second) + ";";
+    return entries;
+}
+
 TEST(TheTextForm, WritesEveryAlternativeBare) {
     EXPECT_EQ(variantToString(Variant(4294967295u)), "4294967295");
     EXPECT_EQ(variantToString(Variant(0u)), "0");
@@ -62,84 +71,58 @@ TEST(TheTextForm, FindsTheFirstEntryOfAName) {
 }
 
 TEST(TheTextForm, ParsesAnEntryAtItsFirstColonAndTrimsBothSides) {
-    std::unique_ptr<Entry> entry(stringToEntry("  Name  :  some value  "));
-    ASSERT_TRUE(entry);
-    EXPECT_EQ(entry->first, "Name");
-    EXPECT_EQ(boost::get<std::string>(entry->second), "some value");
-
-    entry.reset(stringToEntry("Address: 00:11:22:33:44:55"));
-    ASSERT_TRUE(entry);
-    EXPECT_EQ(boost::get<std::string>(entry->second), "00:11:22:33:44:55");
-
-    entry.reset(stringToEntry("\t\r\v\fClass:\n7936 \n"));
-    ASSERT_TRUE(entry);
-    EXPECT_EQ(entry->first, "Class");
-    EXPECT_EQ(entry->second.which(), 3);  // never a number
-    EXPECT_EQ(boost::get<std::string>(entry->second), "7936");
-
-    entry.reset(stringToEntry(":x"));
-    ASSERT_TRUE(entry);
-    EXPECT_EQ(entry->first, "");
-    entry.reset(stringToEntry("Name:"));
-    ASSERT_TRUE(entry);
-    EXPECT_EQ(boost::get<std::string>(entry->second), "");
-
-    EXPECT_EQ(stringToEntry("no colon"), nullptr);
-    EXPECT_EQ(stringToEntry(""), nullptr);
+    const struct {
+        const char* input;
+        const char* entry;
+    } kCases[] = {
+        { "  Name  :  some value  ", "Name=some value;" },
+        { "Address: 00:11:22:33:44:55", "Address=00:11:22:33:44:55;" },
+        { "\t\r\v\fClass:\n7936 \n", "Class=7936;" },  // never a number
+        { ":x", "=x;" },
+        { "Name:", "Name=;" },
+        { "no colon", "null" },
+        { "", "null" },
+    };
+    for (const auto& row : kCases) {
+        std::unique_ptr<Entry> entry(stringToEntry(row.input));
+        Dict one;
+        if (entry) one.push_back(*entry);
+        EXPECT_EQ(described(entry ? &one : nullptr), row.entry) << row.input;
+    }
 }
 
 TEST(TheTextForm, ReadsOnlyEntriesClosedByASeparator) {
-    EXPECT_FALSE(divide("A: 1", ";"));
-    EXPECT_FALSE(divide("x;y;", ";"));
-    EXPECT_FALSE(divide("", ";"));
-    EXPECT_FALSE(divide("A: 1;", ""));
-
-    auto dict = divide("A: 1;B: 2", ";");
-    ASSERT_TRUE(dict);
-    ASSERT_EQ(dict->size(), 1u);
-    EXPECT_EQ(dict->at(0).first, "A");
-
-    dict = divide("A: 1;;B:2;", ";");
-    ASSERT_TRUE(dict);
-    ASSERT_EQ(dict->size(), 2u);
-    EXPECT_EQ(boost::get<std::string>(dict->at(1).second), "2");
-
-    dict = divide("junk;A: 1,B: 2;", ";,");
-    ASSERT_TRUE(dict);
-    ASSERT_EQ(dict->size(), 2u);
-    EXPECT_EQ(dict->at(0).first, "A");
-    EXPECT_EQ(dict->at(1).first, "B");
+    const struct {
+        const char* input;
+        const char* separators;
+        const char* entries;
+    } kCases[] = {
+        { "A: 1", ";", "null" },
+        { "x;y;", ";", "null" },
+        { "", ";", "null" },
+        { "A: 1;", "", "null" },
+        { "A: 1;B: 2", ";", "A=1;" },
+        { "A: 1;;B:2;", ";", "A=1;B=2;" },
+        { "junk;A: 1,B: 2;", ";,", "A=1;B=2;" },
+    };
+    for (const auto& row : kCases)
+        EXPECT_EQ(described(divide(row.input, row.separators).get()), row.entries) << row.input;
 }
 
-TEST(TheTextForm, RoundTripsADictionaryAsStrings) {
+TEST(TheTextForm, RoundTripsADictionaryAsStringsButCutsAValueThatHoldsTheSeparator) {
     Dict dict{ Entry("Address", text("00:11:22:33:44:55")), Entry("Class", Variant(7936u)),
                Entry("RSSI", Variant(-60)), Entry("Paired", Variant(true)),
                Entry("UUIDs", Variant(std::vector<std::string>{ "110b", "110e" })),
                Entry("Vendor", Variant(static_cast<unsigned short>(29))), Entry("Name", text("")),
                Entry("Class", Variant(1u)) };
-    std::string separator = ";";
-    auto back = divide(dictConquerToString(dict, separator), separator);
-    ASSERT_TRUE(back);
-    ASSERT_EQ(back->size(), dict.size());
-    for (size_t i = 0; i < dict.size(); ++i) {
-        EXPECT_EQ(back->at(i).first, dict[i].first);
-        EXPECT_EQ(back->at(i).second.which(), 3);
-        EXPECT_EQ(boost::get<std::string>(back->at(i).second), variantToString(dict[i].second));
-    }
+    std::string separator = ";", asStrings;
+    for (const Entry& entry : dict) asStrings += entry.first + "=" + variantToString(entry.second) + ";";
+    EXPECT_EQ(described(divide(dictConquerToString(dict, separator), separator).get()), asStrings);
+    EXPECT_EQ(described(divide(dictToString(dict), "\n").get()), asStrings);
 
-    auto lines = divide(dictToString(dict), "\n");
-    ASSERT_TRUE(lines);
-    EXPECT_EQ(lines->size(), dict.size());
-}
-
-TEST(TheTextForm, CutsAValueThatHoldsTheSeparator) {
-    Dict dict{ Entry("Name", text("a;b")), Entry("Alias", text("c;D: e")) };
-    std::string separator = ";";
-    auto back = divide(dictConquerToString(dict, separator), separator);
-    ASSERT_TRUE(back);
-    ASSERT_EQ(back->size(), 3u);  // "b" is dropped; "D: e" becomes an entry of its own
-    EXPECT_EQ(boost::get<std::string>(back->at(0).second), "a");
-    EXPECT_EQ(back->at(2).first, "D");
+    // "b" is dropped; "D: e" becomes an entry of its own.
+    Dict cut{ Entry("Name", text("a;b")), Entry("Alias", text("c;D: e")) };
+    EXPECT_EQ(described(divide(dictConquerToString(cut, separator), separator).get()), "Name=a;Alias=c;D=e;");
 }
 
 }  // namespace
