@@ -229,8 +229,10 @@ private:
     int addSignalHandler(std::list<SignalHandler<F> >& list, const char* signalName, F function);
     template <typename F>
     void removeSignalHandlers(std::list<SignalHandler<F> >& list, std::vector<std::string>& rules);
-    // Records a signal's decoding error unless an operation runs on this object.
-    void noteSignalError(int number);
+    // A signal that cannot be decoded: logs what (at line of the dispatcher) and
+    // records number on the dispatching object, if any, unless an operation runs
+    // on it. Returns false, the dispatchers' "not handled".
+    static bool signalUndecodable(RemoteObject* dispatching, int number, int line, const char* what);
     std::string matchRule(const std::string& signalName) const;
     void releaseReply();
     void releaseMessage();

@@ -186,10 +186,14 @@ int RemoteObject::setSignalHandlerStringDict(const char* signalName,
     return addSignalHandler(signalHandlerVectorStringDict, signalName, function);
 }
 
-void RemoteObject::noteSignalError(int number) {
-    std::lock_guard<std::mutex> hold(errorLock);
+bool RemoteObject::signalUndecodable(RemoteObject* dispatching, int number, int line,
+                                     const char* what) {
+    internal::logError(kLogFile, line, "%s", what);
+    if (dispatching == 0) return false;
+    std::lock_guard<std::mutex> hold(dispatching->errorLock);
     // An operation running on another thread keeps its own outcome.
-    if (operationDepth == 0) errorNumber = number;
+    if (dispatching->operationDepth == 0) dispatching->errorNumber = number;
+    return false;
 }
 
 void RemoteObject::signalHandlerDispatcherObjectPath(RemoteObject*, DBusMessage* message) {
@@ -226,18 +230,14 @@ void RemoteObject::signalHandlerDispatcherStringVariant(RemoteObject* dispatchin
                         return false;
                     Entry entry;
                     int number = internal::decodeName(arguments, entry.first);
-                    if (number != 0) {
-                        if (dispatching != 0) dispatching->noteSignalError(number);
-                        BT_LOG_ERR("Failed to parse string in signal");
-                        return false;
-                    }
+                    if (number != 0)
+                        return signalUndecodable(dispatching, number, __LINE__,
+                                                 "Failed to parse string in signal");
                     dbus_message_iter_next(&arguments);
                     number = internal::decodeValue(arguments, entry.second);
-                    if (number != 0) {
-                        if (dispatching != 0) dispatching->noteSignalError(number);
-                        BT_LOG_ERR("Failed to parse variant in signal");
-                        return false;
-                    }
+                    if (number != 0)
+                        return signalUndecodable(dispatching, number, __LINE__,
+                                                 "Failed to parse variant in signal");
                     function(object, entry.first.c_str(), &entry.second);
                     return true;
                 });
@@ -261,13 +261,9 @@ void RemoteObject::signalHandlerDispatcherStringDict(RemoteObject* dispatching,
                     Dict dict;
                     switch (internal::decodeEntries(arguments, dict)) {
                     case internal::kBadEntryName:
-                        if (dispatching != 0) dispatching->noteSignalError(4);
-                        BT_LOG_ERR("Failed to parse entry name");
-                        return false;
+                        return signalUndecodable(dispatching, 4, __LINE__, "Failed to parse entry name");
                     case internal::kBadEntryValue:
-                        if (dispatching != 0) dispatching->noteSignalError(4);
-                        BT_LOG_ERR("Failed to parse entry value");
-                        return false;
+                        return signalUndecodable(dispatching, 4, __LINE__, "Failed to parse entry value");
                     case internal::kEntriesDecoded:
                         break;
                     }
