@@ -264,33 +264,32 @@ DBusMessage* ConnectionLoop::takeReply(dbus_uint32_t serial) {
     return 0;
 }
 
+void ConnectionLoop::readSocket(int milliseconds) {
+    if (!dbus_connection_get_is_connected(connection_)) {
+        // Nothing more will come: the wait is the caller's time-out.
+        bool ignored;
+        pollFor(connection_, wake_[0], milliseconds < 0 ? 100 : std::min(milliseconds, 100), ignored);
+        return;
+    }
+    bool socketReady = false;
+    if (pollFor(connection_, wake_[0], milliseconds, socketReady) < 0 && errno != EINTR)
+        usleep(kBackOffMs * 1000);
+    if (!socketReady) return;
+    dbus_connection_read_write(connection_, 0);
+    // The socket was ready, yet nothing came of it: another thread holds
+    // libdbus's I/O path (a flush) and will read it.
+    if (dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_COMPLETE)
+        usleep(kBackOffMs * 1000);
+}
+
 DBusMessage* ConnectionLoop::pump(int milliseconds, dbus_uint32_t serial, bool dispatch) {
     tPumping = this;
     DBusMessage* mine = serial != 0 ? takeReply(serial) : 0;
-    if (mine == 0) {
-        if (dispatch && dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_DATA_REMAINS) {
-            // Queued by another thread's I/O: nothing to read first.
-        } else if (!dbus_connection_get_is_connected(connection_)) {
-            // Nothing more will come: the wait is the caller's time-out.
-            bool ignored;
-            pollFor(connection_, wake_[0], milliseconds < 0 ? 100 : std::min(milliseconds, 100),
-                    ignored);
-        } else {
-            bool socketReady = false;
-            if (pollFor(connection_, wake_[0], milliseconds, socketReady) < 0 && errno != EINTR)
-                usleep(kBackOffMs * 1000);
-            if (socketReady) {
-                dbus_connection_read_write(connection_, 0);
-                // The socket was ready, yet nothing came of it: another thread
-                // holds libdbus's I/O path (a flush) and will read it.
-                if (dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_COMPLETE) {
-                    bool ignored;
-                    pollFor(connection_, -1, 0, ignored);
-                    usleep(kBackOffMs * 1000);
-                }
-            }
-            if (serial != 0) mine = takeReply(serial);
-        }
+    // What another thread's I/O queued is dispatched before anything is read.
+    bool queued = dispatch && dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_DATA_REMAINS;
+    if (mine == 0 && !queued) {
+        readSocket(milliseconds);
+        if (serial != 0) mine = takeReply(serial);
     }
     // Also the local Disconnected signal and failed pending calls of a closed
     // connection.

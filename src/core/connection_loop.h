@@ -88,6 +88,8 @@ private:
     // and, if dispatch, dispatches it; runs with pumping_ set by the caller.
     // Returns the reply to serial (not 0) when it heads the incoming queue.
     DBusMessage* pump(int milliseconds, dbus_uint32_t serial, bool dispatch);
+    // Waits up to milliseconds for the socket and reads what it holds.
+    void readSocket(int milliseconds);
     // Takes the reply to serial off the incoming queue if it comes first.
     DBusMessage* takeReply(dbus_uint32_t serial);
     void dispatchAll();
