@@ -13,6 +13,14 @@ namespace internal {
 
 namespace {
 
+// Room for guess more elements in values, made at once: growing a vector from
+// nothing element by element reallocates and moves it several times.
+template <typename T>
+void makeRoom(std::vector<T>& values, size_t guess) {
+    if (values.capacity() - values.size() < guess) values.reserve(values.size() + guess);
+}
+
+// Most lists are short (libdbus counts an array's elements only by walking it).
 const size_t kTextsGuess = 8;
 
 // Reads an array of texts (signatures too, if asked) into values. The element
@@ -26,22 +34,19 @@ bool readTexts(DBusMessageIter& array, std::vector<std::string>& values, bool si
     if (type != DBUS_TYPE_STRING && type != DBUS_TYPE_OBJECT_PATH &&
         (type != DBUS_TYPE_SIGNATURE || !signatures))
         return false;
-    // A guess (libdbus counts an array's elements by walking it): most lists
-    // are short, and growing one from nothing reallocates it three times.
-    if (values.capacity() - values.size() < kTextsGuess) values.reserve(values.size() + kTextsGuess);
+    makeRoom(values, kTextsGuess);
     do
         values.emplace_back(readText(element));
     while (dbus_message_iter_next(&element));
     return true;
 }
 
-// Room made for a dictionary at once: BlueZ's property replies hold 10 to 20
-// entries, and growing entry by entry moves every entry several times.
+// BlueZ's property replies hold 10 to 20 entries.
 const size_t kEntriesGuess = 16;
 
 // The text of an entry name of type: a string's own, or a number written into
-// digits; null for another type. Names and values are decoded for types already known:
-// every entry of a dictionary has the same types, asked for once.
+// digits; null for another type. Names and values are decoded for types known
+// already: every entry of a dictionary has the same types, asked for once.
 typedef char Digits[16];
 const char* nameOf(int type, DBusMessageIter& iterator, Digits& digits) {
     if (type == DBUS_TYPE_STRING) return readText(iterator);
@@ -140,7 +145,7 @@ EntriesResult decodeEntries(DBusMessageIter& array, Dict& dict) {
     DBusMessageIter element;
     dbus_message_iter_recurse(&array, &element);
     if (typeOf(element) != DBUS_TYPE_DICT_ENTRY) return kEntriesDecoded;  // none
-    if (dict.capacity() - dict.size() < kEntriesGuess) dict.reserve(dict.size() + kEntriesGuess);
+    makeRoom(dict, kEntriesGuess);
     int nameType = DBUS_TYPE_INVALID;
     int valueType = DBUS_TYPE_INVALID;
     do {
