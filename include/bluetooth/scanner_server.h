@@ -38,12 +38,14 @@ struct ScannerObject {
     GObject parent;
     FinderTable* finders;
 
-    // Creates the finder name: finds the adapter, starts discovery on it,
-    // registers the callbacks and resets the countdown to 30. Returns the
-    // finder's set (the existing one if another thread created it meanwhile),
-    // or null when there is no service or BlueZ does not know the adapter.
+    // Starts the finder name: finds the adapter, starts discovery on it, makes
+    // it one more founder with the callbacks registered and resets the
+    // countdown to 30. Does all of that also when the finder exists, whose set
+    // then stays as it is. Returns the finder's set, or null when there is no
+    // service or BlueZ does not know the adapter.
     AddressSet* addFinder(const char* name);
-    // The set of finder name, created with addFinder when there is none.
+    // The set of finder name. When there is none it is created as addFinder
+    // does, once even when two threads ask for it at the same moment.
     // The set is the service's: it changes on the receiving thread, under the
     // service's lock, and RemoveFinder releases it.
     AddressSet* getListByName(std::string name);
@@ -74,7 +76,8 @@ public:
     virtual ~ScannerServer();
 
     // Starts the finder of adapter (a name or an address that BlueZ's
-    // "FindAdapter" accepts); resets the countdown also when it exists. Before
+    // "FindAdapter" accepts) with addFinder: a finder that exists gets
+    // discovery started again, one more founder and a fresh countdown. Before
     // startLoop, or on the GLib thread.
     void addAdapterFounder(const char* adapter);
     // Whether BlueZ held a device object for address at the last filter update.

@@ -53,10 +53,39 @@ struct ScannerServer::Service {
         return bluez.findAdapter(name);
     }
 
-    // A ListDevices and a DeviceFound may create the same finder at once: the
+    // Starts discovery on the adapter of finder name with the callbacks
+    // registered, and makes it a founder; null when BlueZ does not know it.
+    static Adapter* startFounder(ScannerServer& server, const char* name) {
+        Adapter* adapter = findAdapter(server, name);
+        if (adapter == 0) return 0;
+        adapter->startDiscovery();
+        adapter->setDeviceFoundHandler(&scannerDeviceFound);
+        adapter->setDeviceDisappearedHandler(&scannerDeviceDisappeared);
+        return adapter;
+    }
+
+    static void addFounderLocked(ScannerServer& server, Adapter* adapter) {
+        server.founders->push_back(adapter);
+        server.countdown = kIdleTicks;
+    }
+
+    // A deliberate addFinder: discovery starts again, the adapter becomes one
+    // more founder and the countdown starts again, also when the finder
+    // exists, which then keeps its set.
+    static AddressSet* addFinder(ScannerObject& object, ScannerServer& server, const char* name) {
+        Adapter* adapter = startFounder(server, name);
+        if (adapter == 0) return 0;
+        Hold hold(server.stateLock);
+        addFounderLocked(server, adapter);
+        AddressSet*& set = (*object.finders)[name];
+        if (set == 0) set = new AddressSet;
+        return set;
+    }
+
+    // A finder that a ListDevices and a DeviceFound may both need at once: the
     // first claims its set before the bus calls, so discovery starts once.
     // The set returned only tells whether there is one; read it under the lock.
-    static AddressSet* addFinder(ScannerObject& object, ScannerServer& server, const char* name) {
+    static AddressSet* finder(ScannerObject& object, ScannerServer& server, const std::string& name) {
         AddressSet* claimed = 0;
         {
             Hold hold(server.stateLock);
@@ -64,12 +93,7 @@ struct ScannerServer::Service {
             claimed = new AddressSet;
             (*object.finders)[name] = claimed;
         }
-        Adapter* adapter = findAdapter(server, name);
-        if (adapter != 0) {
-            adapter->startDiscovery();
-            adapter->setDeviceFoundHandler(&scannerDeviceFound);
-            adapter->setDeviceDisappearedHandler(&scannerDeviceDisappeared);
-        }
+        Adapter* adapter = startFounder(server, name.c_str());
         Hold hold(server.stateLock);
         if (adapter == 0) {
             FinderTable::iterator found = object.finders->find(name);
@@ -79,8 +103,7 @@ struct ScannerServer::Service {
             }
             return 0;
         }
-        server.founders->push_back(adapter);
-        server.countdown = kIdleTicks;
+        addFounderLocked(server, adapter);
         return finderLocked(object, name);
     }
 
@@ -294,12 +317,8 @@ AddressSet* ScannerObject::addFinder(const char* name) {
 
 AddressSet* ScannerObject::getListByName(std::string name) {
     ScannerServer* server = ScannerServer::Service::current();
-    if (server != 0) {
-        ScannerServer::Service::Hold hold(server->stateLock);
-        AddressSet* set = ScannerServer::Service::finderLocked(*this, name);
-        if (set != 0) return set;
-    }
-    return addFinder(name.c_str());
+    if (server == 0) return 0;
+    return ScannerServer::Service::finder(*this, *server, name);
 }
 
 // ---- ScannerServer ----

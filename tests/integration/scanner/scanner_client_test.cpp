@@ -159,7 +159,21 @@ TEST(AScannerServer, IgnoresASecondStartLoopAndQuitsWhenAskedFromAnotherThread) 
             ++ticks;
             return ScannerServer::callbackThreadHandler(data);
         }
+        size_t foundersNow() { return founders->size(); }
+        int countdownNow() { return countdown; }
     } server;
+    // Every addAdapterFounder starts discovery and counts down from 30 again,
+    // also for an adapter that has a finder already.
+    const std::string started = sim::defaultAdapterPath() + " org.bluez.Adapter.StartDiscovery()";
+    sim::clearCallLog();
+    for (size_t round = 1; round <= 2; ++round) {
+        server.addAdapterFounder("hci0");
+        EXPECT_EQ(server.foundersNow(), round);
+        EXPECT_EQ(server.countdownNow(), 30);
+        EXPECT_TRUE(waitUntil([&] { return sim::logLinesWith(started).size() == round; }));
+        server.callbackThreadHandler(nullptr);
+    }
+    server.ticks = 0;
     std::thread loop([&] { server.startLoop(); });
     EXPECT_TRUE(waitUntil([&] { return server.ticks > 0; }));
     Clock::time_point start = Clock::now();
