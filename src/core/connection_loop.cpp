@@ -175,6 +175,7 @@ ConnectionLoop::ConnectionLoop(DBusConnection* connection)
       runningWork_(false),
       workSince_(),
       receivers_(0),
+      methodRunners_(0),
       overflowLogged_(false) {
     if (pipe2(wake_, O_NONBLOCK | O_CLOEXEC) != 0) {
         BT_LOG_ERR("Failed to create wake-up pipe (%d)", errno);
@@ -211,6 +212,10 @@ void ConnectionLoop::onDispatchStatus(DBusConnection*, DBusDispatchStatus status
 
 void ConnectionLoop::queue(const Work& work) {
     std::lock_guard<std::mutex> hold(lock_);
+    queueLocked(work);
+}
+
+void ConnectionLoop::queueLocked(const Work& work) {
     if (work_.size() >= kMaxQueued) {
         // Nobody runs the queue (no receiving thread): keep the newest.
         std::deque<Work>::iterator oldest = work_.begin();
@@ -235,11 +240,34 @@ DBusHandlerResult ConnectionLoop::filter(DBusConnection*, DBusMessage* message, 
     return DBUS_HANDLER_RESULT_NOT_YET_HANDLED;
 }
 
+bool ConnectionLoop::handsOverLocked() const { return (receivers_ > 0 && !stopped()) || methodRunners_ > 0; }
+
 DBusHandlerResult ConnectionLoop::defer(DBusMessage* message, DBusObjectPathMessageFunction function,
                                         void* data) {
-    Work work = { dbus_message_ref(message), function, data };
-    queue(work);
-    return DBUS_HANDLER_RESULT_HANDLED;
+    {
+        std::lock_guard<std::mutex> hold(lock_);
+        if (handsOverLocked()) {
+            Work work = { dbus_message_ref(message), function, data };
+            queueLocked(work);
+            return DBUS_HANDLER_RESULT_HANDLED;
+        }
+    }
+    // No thread of ours will run it (the application dispatches the connection
+    // itself): the dispatching thread does, and libdbus answers what it leaves.
+    beginUse(data);
+    DBusHandlerResult result = function(connection_, message, data);
+    endUse(data);
+    return result;
+}
+
+void ConnectionLoop::runLeftMethodCalls(std::unique_lock<std::mutex>& hold) {
+    Work work;
+    while (!handsOverLocked() && takeWork(true, work)) {
+        beginUse(work.data);
+        hold.unlock();
+        runWork(work);
+        hold.lock();
+    }
 }
 
 void ConnectionLoop::dispatchAll() {
@@ -376,8 +404,9 @@ void ConnectionLoop::removeReceiver(RemoteObject* owner) {
         std::multimap<const void*, ConnectionLoop*>::iterator found = gStarting.find(owner);
         if (found != gStarting.end()) gStarting.erase(found);
     }
-    std::lock_guard<std::mutex> hold(lock_);
+    std::unique_lock<std::mutex> hold(lock_);
     --receivers_;
+    runLeftMethodCalls(hold);
 }
 
 void ConnectionLoop::receive() {
@@ -421,6 +450,8 @@ void ConnectionLoop::receive() {
             changed_.wait(hold);
     }
     --receivers_;
+    // Requests handed over to the receiving threads, when this was the last.
+    runLeftMethodCalls(hold);
     changed_.notify_all();
     hold.unlock();
     tReceiving = 0;
@@ -479,6 +510,7 @@ ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, Waiter* wa
     // wait, leaving what is not this reply to be dispatched by that thread.
     bool young = !receiving && receivers_ > 0 && !stopped();
     if (young) ++youngCallers_;
+    if (runMethodCalls) ++methodRunners_;
     bool askedForSocket = false;
     End end;
     for (;;) {
@@ -569,6 +601,10 @@ ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, Waiter* wa
         changed_.wait_until(hold, until);
     }
     if (young) --youngCallers_;
+    if (runMethodCalls) {
+        --methodRunners_;
+        runLeftMethodCalls(hold);
+    }
     return end;
 }
 

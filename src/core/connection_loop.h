@@ -51,8 +51,11 @@ public:
     // dispatch), or null.
     static const char* cannotWait();
 
-    // Queues a method call for a thread that may run callers' code; the Agent's
-    // object path dispatches through this.
+    // A method call for a thread that may run callers' code; the Agent's
+    // object path dispatches through this. It is queued for a receiving thread
+    // or a thread waiting in a pending call; with neither (the application
+    // dispatches the connection itself) it runs here, and its result is
+    // returned to libdbus.
     DBusHandlerResult defer(DBusMessage* message, DBusObjectPathMessageFunction function,
                             void* data);
 
@@ -97,6 +100,11 @@ private:
     // Pops the first work item that may run on this thread; false if none.
     bool takeWork(bool methodCallsOnly, Work& work);
     void queue(const Work& work);
+    void queueLocked(const Work& work);
+    // Whether a thread of ours will run queued method calls.
+    bool handsOverLocked() const;
+    // Runs the method calls queued for threads that are gone.
+    void runLeftMethodCalls(std::unique_lock<std::mutex>& hold);
     void wake();
     bool mayPump(bool receiving, Clock::time_point now) const;
     bool mayDispatch(bool receiving, Clock::time_point now) const;
@@ -126,6 +134,7 @@ private:
     Clock::time_point workSince_;
     std::deque<Work> work_;
     int receivers_;
+    int methodRunners_;  // threads waiting in a pending call, which run method calls
     bool overflowLogged_;
 };
 

@@ -1,6 +1,7 @@
 // Adapter::createPairedDevice with the library's own Agent answering
 // bluez4-sim, and the agent answering outside any pairing call.
 #include <algorithm>
+#include <atomic>
 #include <chrono>
 #include <memory>
 #include <mutex>
@@ -8,6 +9,7 @@
 #include <thread>
 #include <vector>
 
+#include <dbus/dbus-glib-lowlevel.h>
 #include <gtest/gtest.h>
 
 #include <bluetooth/btbus.h>
@@ -198,45 +200,80 @@ TEST_F(APairing, AgentAuthorisesIncomingConnectionsOnTheReceivingThread) {
     EXPECT_NE(gThreads[1], std::this_thread::get_id());
 }
 
-// Calls the agent from a connection of the test's own, the way a peer would:
-// the error name of the answer ("" for a method return).
+// Calls the agent from a connection of the test's own, the way a peer would,
+// with arguments of the given types: the reply's first argument as text ("" for
+// none), or the error's name.
 std::string callAsAPeer(const std::string& destination, const char* path, const char* member, int timeoutMs,
-                        bool withDeviceAndPasskey) {
+                        const char* types = "") {
     DBusConnection* connection = dbus_bus_get_private(DBUS_BUS_SYSTEM, nullptr);
     if (connection == nullptr) return "no connection";
     dbus_connection_set_exit_on_disconnect(connection, FALSE);
     Bluetooth::internal::MessagePtr message(
         dbus_message_new_method_call(destination.c_str(), path, "org.bluez.Agent", member));
-    if (withDeviceAndPasskey) {
-        const char* device = "/org/bluez/1/hci0/dev_00_11_22_33_44_55";
-        dbus_uint32_t passkey = 123456;
-        dbus_message_append_args(message.get(), DBUS_TYPE_OBJECT_PATH, &device, DBUS_TYPE_UINT32, &passkey,
-                                 DBUS_TYPE_INVALID);
+    const char* device = "/org/bluez/1/hci0/dev_00_11_22_33_44_55";
+    const char* uuid = kA2dpSink;
+    dbus_uint32_t passkey = 123456;
+    for (const char* type = types; *type != '\0'; ++type) {
+        if (*type == 'o') dbus_message_append_args(message.get(), DBUS_TYPE_OBJECT_PATH, &device, DBUS_TYPE_INVALID);
+        if (*type == 'u') dbus_message_append_args(message.get(), DBUS_TYPE_UINT32, &passkey, DBUS_TYPE_INVALID);
+        if (*type == 's') dbus_message_append_args(message.get(), DBUS_TYPE_STRING, &uuid, DBUS_TYPE_INVALID);
     }
     Bluetooth::internal::ScopedError error;
     Bluetooth::internal::MessagePtr reply(
         dbus_connection_send_with_reply_and_block(connection, message.get(), timeoutMs, error.get()));
     dbus_connection_close(connection);
     dbus_connection_unref(connection);
-    return error.name();
+    DBusMessageIter value;
+    if (!reply || !dbus_message_iter_init(reply.get(), &value)) return error.name();
+    if (dbus_message_iter_get_arg_type(&value) == DBUS_TYPE_UINT32) {
+        dbus_message_iter_get_basic(&value, &passkey);
+        return std::to_string(passkey);
+    }
+    const char* text = "?";
+    if (dbus_message_iter_get_arg_type(&value) == DBUS_TYPE_STRING) dbus_message_iter_get_basic(&value, &text);
+    return text;
 }
 
-TEST_F(APairing, AgentLogsAndLeavesUnansweredWhatItCannotHandle) {
+// Every kind of request a peer can make of the agent, whichever thread
+// dispatches the connection: the answer, and the line logged.
+void expectAnswersToPeers(const std::string& me, const Agent& agent) {
+    const struct {
+        const char* member;
+        const char* types;
+        const char* answer;
+        const char* log;
+    } rows[] = {
+        { "RequestPinCode", "o", "482913", "" },
+        { "RequestPasskey", "o", "482913", "" },
+        { "RequestConfirmation", "ou", "", "" },
+        { "Authorize", "os", "", "" },
+        { "Cancel", "", "", "" },
+        { "Release", "", "", "" },
+        // Not the agent's answers: libdbus answers what no handler took.
+        { "DisplayPasskey", "ou", "org.freedesktop.DBus.Error.UnknownMethod",
+          "agent.cpp:410 Registered agent does not provide a handler for the incoming message." },
+        { "RequestPasskey", "", "org.freedesktop.DBus.Error.UnknownMethod",
+          "agent.cpp:200 Failed to get argument from request passkey message." },
+        // Bad arguments of a PIN request count as handled: no answer at all.
+        { "RequestPinCode", "", "org.freedesktop.DBus.Error.NoReply",
+          "agent.cpp:167 Failed to get argument from request pin code message." },
+    };
+    for (const auto& row : rows) {
+        SCOPED_TRACE(std::string(row.member) + "(" + row.types + ")");
+        LogCapture log;
+        auto start = std::chrono::steady_clock::now();
+        EXPECT_EQ(callAsAPeer(me, agent.getPath(), row.member, 1000, row.types), row.answer);
+        if (*row.log == '\0') EXPECT_LT(std::chrono::steady_clock::now() - start, 500ms);
+        EXPECT_EQ(log.lines(), *row.log ? std::vector<std::string>{ row.log } : std::vector<std::string>{});
+    }
+}
+
+TEST_F(APairing, AgentAnswersPeersOnTheReceivingThreadAndLogsWhatItCannotHandle) {
     sim::receivingLoop();
-    const std::string me = adapter->getConnectionName();
-    LogCapture log;
-    // Not the agent's answer: libdbus answers what no handler took.
-    EXPECT_EQ(callAsAPeer(me, agent.getPath(), "DisplayPasskey", 3000, true),
-              "org.freedesktop.DBus.Error.UnknownMethod");
-    EXPECT_EQ(callAsAPeer(me, agent.getPath(), "RequestPasskey", 3000, false),
-              "org.freedesktop.DBus.Error.UnknownMethod");
-    // Bad arguments of a PIN request count as handled: no answer at all.
-    EXPECT_EQ(callAsAPeer(me, agent.getPath(), "RequestPinCode", 300, false),
-              "org.freedesktop.DBus.Error.NoReply");
-    EXPECT_EQ(log.lines(), (std::vector<std::string>{
-                               "agent.cpp:410 Registered agent does not provide a handler for the incoming message.",
-                               "agent.cpp:200 Failed to get argument from request passkey message.",
-                               "agent.cpp:167 Failed to get argument from request pin code message." }));
+    ASSERT_EQ(agent.setPasskeyValue("482913"), 0);
+    expectAnswersToPeers(adapter->getConnectionName(), agent);
+    std::lock_guard<std::mutex> lock(gLock);
+    EXPECT_EQ(std::count(gThreads.begin(), gThreads.end(), std::this_thread::get_id()), 0);
 }
 
 TEST_F(APairing, AgentPathIsRegisteredOncePerProcessAndFreedWhenItsAgentIsDestroyed) {
@@ -257,46 +294,85 @@ TEST_F(APairing, AgentPathIsRegisteredOncePerProcessAndFreedWhenItsAgentIsDestro
     ASSERT_EQ(forgotten->registerPath(), 0);
     const std::string path = forgotten->getPath();
     forgotten.reset();  // without unregisterPath
-    EXPECT_EQ(callAsAPeer(adapter->getConnectionName(), path.c_str(), "Release", 3000, false),
+    EXPECT_EQ(callAsAPeer(adapter->getConnectionName(), path.c_str(), "Release", 3000),
               "org.freedesktop.DBus.Error.UnknownMethod");
     EXPECT_EQ(agent.registerPath(), 0);
 }
 
-TEST_F(APairing, WithoutAReceivingThreadIsAnsweredOnTheCallersThreadOrOnceALoopStarts) {
+// Without a receiving thread of the library, whichever thread dispatches the
+// connection answers: the pairing call's own, a blocking call's, or a loop of
+// the program's own.
+TEST_F(APairing, WithoutAReceivingThreadIsAnsweredByTheThreadThatDispatches) {
     if (btbus_test::childRole() != "no-loop") {
         // Another receiving thread may already run here: run it in a fresh process.
-        EXPECT_EQ(btbus_test::runInChild(
-                      "APairing.WithoutAReceivingThreadIsAnsweredOnTheCallersThreadOrOnceALoopStarts", "no-loop"), 0);
+        EXPECT_EQ(btbus_test::runInChild("APairing.WithoutAReceivingThreadIsAnsweredByTheThreadThatDispatches",
+                                         "no-loop"),
+                  0);
         return;
     }
     ASSERT_FALSE(sim::receivingLoopRunning());
     ASSERT_EQ(agent.setPasskeyValue("0000"), 0);
     std::unique_ptr<Device> keyboard(adapter->createPairedDevice(kKeyboard, agent));
     EXPECT_NE(keyboard, nullptr) << adapter->getErrorMessage();
-    {
-        std::lock_guard<std::mutex> lock(gLock);
-        ASSERT_FALSE(gThreads.empty());
-        EXPECT_EQ(gMembers[0], "RequestPinCode");
-        EXPECT_EQ(gThreads[0], std::this_thread::get_id());
-    }
     ASSERT_TRUE(sim::start());  // the keyboard unpaired again
-    // A plain blocking call answers nobody's requests: the agent's PIN request
-    // waits for the loop started after the call was made.
-    std::thread caller([this] {
-        adapter->newMessage("CreatePairedDevice");
-        adapter->append(kKeyboard);
-        adapter->append(ObjectPath(agent.getPath()));
-        adapter->append(agent.getCapability());
-        auto start = std::chrono::steady_clock::now();
-        EXPECT_EQ(adapter->sendMessage(true, -1), 0) << adapter->getErrorMessage();
-        EXPECT_LT(std::chrono::steady_clock::now() - start, 5s);
-    });
-    std::this_thread::sleep_for(300ms);
-    sim::receivingLoop();
-    caller.join();
+    adapter->newMessage("CreatePairedDevice");
+    adapter->append(kKeyboard);
+    adapter->append(ObjectPath(agent.getPath()));
+    adapter->append(agent.getCapability());
+    EXPECT_EQ(adapter->sendMessage(true, -1), 0) << adapter->getErrorMessage();
     ObjectPath device;
     EXPECT_EQ(adapter->getReplyValue(device), 0);
     EXPECT_EQ(device.str(), sim::devicePath(kKeyboard));
+    {
+        // The last Release may follow the reply: the next thread that dispatches answers it.
+        std::lock_guard<std::mutex> lock(gLock);
+        ASSERT_GE(gMembers.size(), 3u);
+        EXPECT_EQ(std::vector<std::string>(gMembers.begin(), gMembers.begin() + 3),
+                  (std::vector<std::string>{ "RequestPinCode", "Release", "RequestPinCode" }));
+        EXPECT_EQ(std::count(gThreads.begin(), gThreads.begin() + 3, std::this_thread::get_id()), 3);
+    }
+
+    // A program's own loop, as a GLib main loop or plain libdbus runs it.
+    DBusConnection* system = Connection::get(DBUS_BUS_SYSTEM);
+    std::atomic<bool> dispatching{ true };
+    std::thread::id loopThread;
+    std::thread loop([&] {
+        loopThread = std::this_thread::get_id();
+        while (dispatching) dbus_connection_read_write_dispatch(system, 20);
+    });
+    ASSERT_TRUE(waitUntil([] {
+        std::vector<std::string> seen = members();
+        return std::count(seen.begin(), seen.end(), "Release") == 2;
+    }));
+    {
+        std::lock_guard<std::mutex> lock(gLock);
+        gMembers.clear();
+        gThreads.clear();
+    }
+    ASSERT_EQ(agent.setPasskeyValue("482913"), 0);
+    expectAnswersToPeers(adapter->getConnectionName(), agent);
+    ASSERT_EQ(agent.setPasskeyDelay(1), 0);
+    auto start = std::chrono::steady_clock::now();
+    EXPECT_EQ(callAsAPeer(adapter->getConnectionName(), agent.getPath(), "RequestPinCode", 3000, "o"), "482913");
+    EXPECT_GE(std::chrono::steady_clock::now() - start, 1s);
+    dispatching = false;
+    loop.join();
+    {
+        std::lock_guard<std::mutex> lock(gLock);
+        EXPECT_EQ(gThreads.size(), 10u);
+        EXPECT_EQ(std::count(gThreads.begin(), gThreads.end(), loopThread), 10);
+    }
+    // The same through a GLib main loop that the connection is attached to.
+    dbus_connection_setup_with_g_main(system, nullptr);
+    GMainLoop* glibLoop = g_main_loop_new(nullptr, FALSE);
+    std::thread glib([glibLoop] { g_main_loop_run(glibLoop); });
+    EXPECT_EQ(callAsAPeer(adapter->getConnectionName(), agent.getPath(), "RequestPasskey", 3000, "o"), "482913");
+    EXPECT_EQ(callAsAPeer(adapter->getConnectionName(), agent.getPath(), "DisplayPasskey", 3000, "ou"),
+              "org.freedesktop.DBus.Error.UnknownMethod");
+    g_main_loop_quit(glibLoop);
+    glib.join();
+    g_main_loop_unref(glibLoop);
+    Connection::unref(system);
 }
 
 TEST_F(APairing, AgentAnswersAnIncomingPinRequestLeavingOtherCallsPromptAndIsReleasedWhenUnregistered) {
