@@ -2,6 +2,7 @@
 
 #include <cstdlib>
 #include <iterator>
+#include <set>
 #include <vector>
 
 #include <sys/mount.h>
@@ -59,8 +60,37 @@ bool overlay(const std::string& directory, std::string& why) {
     return false;
 }
 
+bool privateTmp(const std::vector<std::string>& keep, std::string& why) {
+    std::set<std::string> trees;  // the entries of /tmp that hold what is kept
+    for (const std::string& path : keep) {
+        char* real = realpath(path.c_str(), nullptr);
+        std::string found = real != nullptr ? real : "";
+        std::free(real);
+        if (found.compare(0, 5, "/tmp/") == 0) trees.insert(found.substr(0, found.find('/', 5)));
+    }
+    // Put together aside, then moved onto /tmp.
+    std::string fresh = scratchDir() + "/private-tmp";
+    mkdir(fresh.c_str(), 0755);
+    if (mount("tmpfs", fresh.c_str(), "tmpfs", 0, "size=16m,mode=1777") != 0) {
+        why = "cannot mount a tmpfs on " + fresh;
+        return false;
+    }
+    for (const std::string& tree : trees) {
+        std::string at = fresh + tree.substr(4);
+        mkdir(at.c_str(), 0755);
+        if (mount(tree.c_str(), at.c_str(), nullptr, MS_BIND, nullptr) != 0) {
+            why = "cannot bind " + tree + " into the private /tmp";
+            return false;
+        }
+    }
+    if (mount(fresh.c_str(), "/tmp", nullptr, MS_MOVE, nullptr) == 0) return true;
+    why = "cannot move the private tmpfs onto /tmp";
+    return false;
+}
+
 bool privateSystemDirectories(std::string& why) {
-    if (!tmpfs("/tmp", why) || !overlay("/etc", why) || !overlay("/usr/sbin", why)) return false;
+    // A checkout or a build tree cloned under /tmp stays reachable.
+    if (!privateTmp({ BTBUS_SOURCE_DIR, BTBUS_TEST_TMP, "/proc/self/exe" }, why) || !overlay("/etc", why) || !overlay("/usr/sbin", why)) return false;
     mkdir("/etc/bluetooth", 0755);
     return tmpfs("/etc/bluetooth", why);
 }

@@ -2,6 +2,7 @@
 #define BTBUS_TESTS_SUPPORT_NAMESPACE_H
 
 #include <string>
+#include <vector>
 
 #include <gtest/gtest.h>
 
@@ -18,8 +19,13 @@ bool inPrivateNamespace(std::string& skip);
 // this namespace sees them. False with why set on failure.
 bool overlay(const std::string& directory, std::string& why);
 
-// In a private namespace: a tmpfs on /tmp, /etc/bluetooth empty, /usr/sbin
-// writable. False with why set on failure.
+// In a private namespace: an empty tmpfs on /tmp but for the entries of /tmp
+// that hold the paths in keep, bound back in at their own paths. False with
+// why set on failure.
+bool privateTmp(const std::vector<std::string>& keep, std::string& why);
+
+// In a private namespace: a private /tmp that keeps this test's trees,
+// /etc/bluetooth empty, /usr/sbin writable. False with why set on failure.
 bool privateSystemDirectories(std::string& why);
 
 }  // namespace btbus_test
