@@ -28,14 +28,17 @@ std::set<std::string> entriesOfTmp() {
 
 TEST(PrivateMounts, KeepTheTreesUnderTmpTheyRunFrom) {
     BTBUS_IN_PRIVATE_NAMESPACE();
-    // In this namespace only: a /tmp that holds a checkout, a build tree and a stray file.
-    const std::string build = std::string(BTBUS_TEST_TMP) + "/..";
-    ASSERT_EQ(mount("tmpfs", "/tmp", "tmpfs", 0, "size=4m"), 0);
-    mkdir("/tmp/checkout", 0755);
-    mkdir("/tmp/build", 0755);
-    ASSERT_EQ(mount(BTBUS_SOURCE_DIR, "/tmp/checkout", nullptr, MS_BIND, nullptr), 0);
-    ASSERT_EQ(mount(build.c_str(), "/tmp/build", nullptr, MS_BIND, nullptr), 0);
-    std::ofstream("/tmp/stray") << "";
+    // In this namespace only: a /tmp that holds a checkout, a build tree and a
+    // stray file, put together aside (the trees may lie under /tmp already).
+    const std::string build = std::string(BTBUS_TEST_TMP) + "/..", fake = btbus_test::scratchDir() + "/tmp";
+    mkdir(fake.c_str(), 0755);
+    ASSERT_EQ(mount("tmpfs", fake.c_str(), "tmpfs", 0, "size=4m"), 0);
+    mkdir((fake + "/checkout").c_str(), 0755);
+    mkdir((fake + "/build").c_str(), 0755);
+    ASSERT_EQ(mount(BTBUS_SOURCE_DIR, (fake + "/checkout").c_str(), nullptr, MS_BIND, nullptr), 0);
+    ASSERT_EQ(mount(build.c_str(), (fake + "/build").c_str(), nullptr, MS_BIND, nullptr), 0);
+    std::ofstream(fake + "/stray") << "";
+    ASSERT_EQ(mount(fake.c_str(), "/tmp", nullptr, MS_MOVE, nullptr), 0);
     const std::string scratch = "/tmp/build/test-tmp/private-mounts";
     mkdir(scratch.c_str(), 0755);
 
