@@ -24,7 +24,8 @@ demo: build
 	scripts/demo.sh $(BUILD)
 
 # Speed of the receiving loop against raw libdbus, measured in one run; then
-# btbus-scanner's ListDevices latency and memory with up to 10,000 devices.
+# btbus-scanner's ListDevices latency and memory with up to 10,000 devices; then
+# the instructions of decoding and of a plain blocking call against raw libdbus.
 bench: build
 	cd $(BUILD) && taskset -c 0 ./bench/btbus-bench-loop && ./bench/btbus-bench-scanner
 	$(CURDIR)/bench/decode_instructions.sh $(BUILD)/bench/btbus-bench-loop $(BUILD)/bench

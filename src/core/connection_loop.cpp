@@ -292,36 +292,41 @@ DBusMessage* ConnectionLoop::takeReply(dbus_uint32_t serial) {
     return 0;
 }
 
-void ConnectionLoop::readSocket(int milliseconds) {
+bool ConnectionLoop::readSocket(int milliseconds) {
     if (!dbus_connection_get_is_connected(connection_)) {
         // Nothing more will come: the wait is the caller's time-out.
         bool ignored;
         pollFor(connection_, wake_[0], milliseconds < 0 ? 100 : std::min(milliseconds, 100), ignored);
-        return;
+        return false;
     }
     bool socketReady = false;
     if (pollFor(connection_, wake_[0], milliseconds, socketReady) < 0 && errno != EINTR)
         usleep(kBackOffMs * 1000);
-    if (!socketReady) return;
+    if (!socketReady) return false;
     dbus_connection_read_write(connection_, 0);
+    if (dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_DATA_REMAINS) return true;
     // The socket was ready, yet nothing came of it: another thread holds
     // libdbus's I/O path (a flush) and will read it.
-    if (dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_COMPLETE)
-        usleep(kBackOffMs * 1000);
+    usleep(kBackOffMs * 1000);
+    return false;
 }
 
-DBusMessage* ConnectionLoop::pump(int milliseconds, dbus_uint32_t serial, bool dispatch) {
+DBusMessage* ConnectionLoop::pump(int milliseconds, dbus_uint32_t serial, bool dispatch, bool fresh) {
     tPumping = this;
-    DBusMessage* mine = serial != 0 ? takeReply(serial) : 0;
-    // What another thread's I/O queued is dispatched before anything is read.
-    bool queued = dispatch && dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_DATA_REMAINS;
-    if (mine == 0 && !queued) {
-        readSocket(milliseconds);
-        if (serial != 0) mine = takeReply(serial);
+    DBusMessage* mine = 0;
+    if (dispatch) {
+        // What another thread's I/O queued is dispatched before anything is
+        // read; right after a call was sent, that woke this thread through the
+        // pipe. Dispatching completes the pending call of a reply, also the
+        // failed ones of a closed connection, with the local Disconnected.
+        if (fresh || dbus_connection_get_dispatch_status(connection_) != DBUS_DISPATCH_DATA_REMAINS)
+            readSocket(milliseconds);
+        dispatchAll();
+    } else {
+        // Leaves the rest to be dispatched by a receiving thread.
+        if (!fresh) mine = takeReply(serial);
+        if (mine == 0 && readSocket(milliseconds)) mine = takeReply(serial);
     }
-    // Also the local Disconnected signal and failed pending calls of a closed
-    // connection.
-    if (dispatch) dispatchAll();
     tPumping = 0;
     return mine;
 }
@@ -437,7 +442,7 @@ void ConnectionLoop::receive() {
         if (!pumping_ && !callersRead) {
             pumping_ = receiverPumping_ = true;
             hold.unlock();
-            pump(dbus_connection_get_is_connected(connection_) ? -1 : 100, 0, true);
+            pump(dbus_connection_get_is_connected(connection_) ? -1 : 100, 0, true, false);
             hold.lock();
             pumping_ = receiverPumping_ = false;
             pumpFreeSince_ = Clock::now();
@@ -512,6 +517,7 @@ ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, Waiter* wa
     if (young) ++youngCallers_;
     if (runMethodCalls) ++methodRunners_;
     bool askedForSocket = false;
+    bool fresh = true;  // nothing read for this call yet
     End end;
     for (;;) {
         // Also asked of the call: it may have completed before the notify was set.
@@ -571,7 +577,8 @@ ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, Waiter* wa
             receiverPumping_ = receiving;
             readerWaiter_ = waiter;
             hold.unlock();
-            DBusMessage* mine = pump(slice, serial, !young);
+            DBusMessage* mine = pump(slice, serial, !young, fresh);
+            fresh = false;
             bool remains = young && dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_DATA_REMAINS;
             hold.lock();
             pumping_ = receiverPumping_ = false;
@@ -618,7 +625,8 @@ DBusMessage* ConnectionLoop::call(DBusMessage* message, int timeout, DBusError* 
         dbus_set_error_const(error, DBUS_ERROR_DISCONNECTED, "Connection is closed");
         return 0;
     }
-    dbus_connection_flush(connection_);
+    // Sending wrote what it could; what is left is written by the wait's reads.
+    if (dbus_connection_has_messages_to_send(connection_)) dbus_connection_flush(connection_);
     DBusMessage* reply = 0;
     End end = wait(pending, dbus_message_get_serial(message), timeout, false, 0, &reply);
     if (end != kReplied) {

@@ -89,10 +89,12 @@ private:
 
     // Reads what the socket holds (waiting up to milliseconds, -1 without end)
     // and, if dispatch, dispatches it; runs with pumping_ set by the caller.
-    // Returns the reply to serial (not 0) when it heads the incoming queue.
-    DBusMessage* pump(int milliseconds, dbus_uint32_t serial, bool dispatch);
-    // Waits up to milliseconds for the socket and reads what it holds.
-    void readSocket(int milliseconds);
+    // Without dispatch, returns the reply to serial when it heads the incoming
+    // queue. fresh: the first read for a call just sent.
+    DBusMessage* pump(int milliseconds, dbus_uint32_t serial, bool dispatch, bool fresh);
+    // Waits up to milliseconds for the socket and reads what it holds; true
+    // when messages are queued then.
+    bool readSocket(int milliseconds);
     // Takes the reply to serial off the incoming queue if it comes first.
     DBusMessage* takeReply(dbus_uint32_t serial);
     void dispatchAll();

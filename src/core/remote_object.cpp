@@ -134,9 +134,17 @@ int RemoteObject::newMessage(const char* method) {
     releaseMessage();
     // libdbus aborts the process on names it considers invalid, so they are
     // checked here and reported like any other failure to create the call.
-    if (!dbus_validate_bus_name(destination.c_str(), 0) || !dbus_validate_path(path.c_str(), 0) ||
-        !dbus_validate_interface(interface.c_str(), 0) || !dbus_validate_member(method, 0))
-        return fail(6);
+    // The object's own names, checked once per thread until they change.
+    thread_local std::string validDestination, validPath, validInterface;
+    if (destination != validDestination || path != validPath || interface != validInterface) {
+        if (!dbus_validate_bus_name(destination.c_str(), 0) || !dbus_validate_path(path.c_str(), 0) ||
+            !dbus_validate_interface(interface.c_str(), 0))
+            return fail(6);
+        validDestination = destination;
+        validPath = path;
+        validInterface = interface;
+    }
+    if (!dbus_validate_member(method, 0)) return fail(6);
     message = dbus_message_new_method_call(destination.c_str(), path.c_str(), interface.c_str(),
                                            method);
     return message != 0 ? 0 : fail(6);
