@@ -29,22 +29,21 @@ std::set<std::string> entriesOfTmp() {
 TEST(PrivateMounts, KeepTheTreesUnderTmpTheyRunFrom) {
     BTBUS_IN_PRIVATE_NAMESPACE();
     // In this namespace only: a /tmp that holds a checkout, a build tree and a
-    // stray file, put together aside (the trees may lie under /tmp already).
-    const std::string build = std::string(BTBUS_TEST_TMP) + "/..", fake = btbus_test::scratchDir() + "/tmp";
-    mkdir(fake.c_str(), 0755);
-    ASSERT_EQ(mount("tmpfs", fake.c_str(), "tmpfs", 0, "size=4m"), 0);
-    mkdir((fake + "/checkout").c_str(), 0755);
-    mkdir((fake + "/build").c_str(), 0755);
-    ASSERT_EQ(mount(BTBUS_SOURCE_DIR, (fake + "/checkout").c_str(), nullptr, MS_BIND, nullptr), 0);
-    ASSERT_EQ(mount(build.c_str(), (fake + "/build").c_str(), nullptr, MS_BIND, nullptr), 0);
-    std::ofstream(fake + "/stray") << "";
-    ASSERT_EQ(mount(fake.c_str(), "/tmp", nullptr, MS_MOVE, nullptr), 0);
+    // stray file, beside the trees this test runs from if they lie under /tmp.
+    std::string why;
+    ASSERT_TRUE(btbus_test::privateTmp({ BTBUS_SOURCE_DIR, BTBUS_TEST_TMP, "/proc/self/exe" }, why)) << why;
+    const std::string build = std::string(BTBUS_TEST_TMP) + "/..";
+    mkdir("/tmp/checkout", 0755);
+    mkdir("/tmp/build", 0755);
+    ASSERT_EQ(mount(BTBUS_SOURCE_DIR, "/tmp/checkout", nullptr, MS_BIND, nullptr), 0);
+    ASSERT_EQ(mount(build.c_str(), "/tmp/build", nullptr, MS_BIND, nullptr), 0);
+    std::ofstream("/tmp/stray") << "";
     const std::string scratch = "/tmp/build/test-tmp/private-mounts";
     mkdir(scratch.c_str(), 0755);
 
     // The script, as the demo and btbusctl's tests run it from the checkout.
     std::string seen;
-    FILE* inside = popen(("/tmp/checkout/scripts/in-private-mounts.sh " + scratch +
+    FILE* inside = popen(("cd / && TMPDIR=/tmp/build/test-tmp /tmp/checkout/scripts/in-private-mounts.sh " + scratch +
                           " sh -c 'ls /tmp && test -r /tmp/checkout/README.md && touch /etc/bluetooth/x && echo ok'")
                              .c_str(),
                          "r");
@@ -55,7 +54,6 @@ TEST(PrivateMounts, KeepTheTreesUnderTmpTheyRunFrom) {
     EXPECT_EQ(seen, "build\ncheckout\nok\n");
 
     // The tests' own helper, kept to what a test runs from.
-    std::string why;
     ASSERT_TRUE(btbus_test::privateTmp({ "/tmp/checkout/scripts", "/tmp/build/test-tmp" }, why)) << why;
     EXPECT_EQ(entriesOfTmp(), (std::set<std::string>{ "build", "checkout" }));
     EXPECT_TRUE(std::ifstream("/tmp/checkout/README.md").good());
