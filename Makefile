@@ -2,7 +2,7 @@
 BUILD ?= build
 JOBS ?= $(shell nproc)
 
-.PHONY: all deps configure build check demo bench sanitize tsan clean
+.PHONY: all deps configure build check check-ppc demo bench sanitize tsan clean
 
 all: build
 
@@ -18,6 +18,20 @@ build: configure
 # Builds everything and runs every test on private buses.
 check: build
 	cd $(BUILD) && ctest --output-on-failure -j 2
+
+# The library, its tools and its tests built for the appliance's 32-bit
+# big-endian PowerPC with Debian's cross compiler, against a sysroot built from
+# Debian's sources (kept in ~/.cache/btbus), and run under qemu against native
+# buses and bluez4-sim: every message crosses between byte orders.
+PPC_BUILD ?= $(BUILD)-ppc
+check-ppc:
+	@scripts/install-deps.sh ppc
+	sysroot=$$(scripts/ppc-sysroot.sh) && \
+	cmake -S . -B $(PPC_BUILD) -DCMAKE_TOOLCHAIN_FILE=cmake/cross-toolchain.cmake -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+	  -DBTBUS_SYSROOT=$$sysroot -DBTBUS_CROSS_PREFIX=powerpc-linux-gnu- -DBTBUS_BUILD_BENCHMARKS=OFF \
+	  "-DBTBUS_EMULATOR=qemu-ppc;-L;/usr/powerpc-linux-gnu;-E;LD_LIBRARY_PATH=$$sysroot/usr/lib"
+	cmake --build $(PPC_BUILD) -j $(JOBS)
+	cd $(PPC_BUILD) && ctest --output-on-failure -j 2
 
 # Runs the main job against the BlueZ 4 simulator on private buses.
 demo: build
@@ -45,4 +59,4 @@ tsan: deps
 	  ctest --output-on-failure -j 2 -R "btbus_(core|bluez|scanner)_tests"
 
 clean:
-	rm -rf $(BUILD) $(BUILD)-sanitize $(BUILD)-tsan
+	rm -rf $(BUILD) $(BUILD)-sanitize $(BUILD)-tsan $(PPC_BUILD)

@@ -1,6 +1,7 @@
 #!/bin/sh
 # Installs the Debian packages that building and testing btbus need, when some
-# are missing. As root it runs apt-get; otherwise it prints the one line to run
+# are missing; with the argument ppc, also those of the PowerPC cross build and
+# its sysroot. As root it runs apt-get; otherwise it prints the one line to run
 # and fails. Safe to run again: it does nothing when everything is there.
 set -eu
 
@@ -8,6 +9,10 @@ PACKAGES="cmake make g++ pkg-config
 libdbus-1-dev dbus-daemon dbus-bin libdbus-glib-1-dev libdbus-glib-1-dev-bin libglib2.0-dev libbluetooth-dev libboost-dev
 libgtest-dev libbenchmark-dev libcli11-dev nlohmann-json3-dev
 python3-dbus python3-gi python3-dbusmock libglib2.0-bin util-linux systemd"
+if [ "${1:-}" = ppc ]; then
+    PACKAGES="$PACKAGES g++-powerpc-linux-gnu qemu-user meson ninja-build autoconf automake libtool
+googletest bzip2 xz-utils dpkg-dev"
+fi
 
 missing=""
 for package in $PACKAGES; do

@@ -12,7 +12,8 @@ import unittest
 
 from simharness import SimTestCase, run_until
 
-BTBUSCTL = os.environ['BTBUSCTL']
+# Through the emulator that runs the target's programs, in a cross-built run.
+BTBUSCTL = [*os.environ.get('BTBUS_TEST_EMULATOR', '').split(), os.environ['BTBUSCTL']]
 IN_PRIVATE_MOUNTS = os.path.join(os.path.dirname(__file__), '..', '..', 'scripts', 'in-private-mounts.sh')
 # Runs the commands of argv[1] (JSON) and prints their [status, stdout, stderr] as JSON.
 RUNNER = ('import json, subprocess, sys\n'
@@ -27,12 +28,12 @@ class BtbusctlTest(SimTestCase):
     extra_args = ('--service-dir', os.environ['BTBUS_SERVICE_DIR'])  # the scanner service
 
     def btbusctl(self, *args, env=None):
-        done = subprocess.run([BTBUSCTL, *args], env=env or self.launcher.env, capture_output=True,
+        done = subprocess.run([*BTBUSCTL, *args], env=env or self.launcher.env, capture_output=True,
                               text=True, timeout=30)
         return done.returncode, done.stdout, done.stderr
 
     def start(self, *args):
-        proc = subprocess.Popen([BTBUSCTL, '--json', *args], env=self.launcher.env, stdout=subprocess.PIPE,
+        proc = subprocess.Popen([*BTBUSCTL, '--json', *args], env=self.launcher.env, stdout=subprocess.PIPE,
                                 text=True)
         self.addCleanup(self.stop, proc)
         return proc
@@ -142,7 +143,7 @@ class BtbusctlTest(SimTestCase):
         self.addCleanup(os.rmdir, scratch)
 
         def in_private_mounts(commands):
-            commands = [c if c[0] == 'cat' else [BTBUSCTL, *c] for c in commands]
+            commands = [c if c[0] == 'cat' else [*BTBUSCTL, *c] for c in commands]
             out = subprocess.run([IN_PRIVATE_MOUNTS, scratch, '/usr/bin/python3', '-c', RUNNER, json.dumps(commands)],
                                  env=self.launcher.env, capture_output=True, text=True, timeout=60, check=True).stdout
             return json.loads(out)

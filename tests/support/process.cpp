@@ -1,12 +1,15 @@
 #include "support/process.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <csignal>
 #include <cstdlib>
+#include <cstring>
 #include <thread>
 
 #include <fcntl.h>
 #include <poll.h>
+#include <spawn.h>
 #include <sys/prctl.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -36,7 +39,41 @@ std::string onPath(const std::string& argv0) {
     return argv0;
 }
 
+std::vector<std::string> emulator() {
+    std::vector<std::string> words;
+    const char* text = std::getenv("BTBUS_TEST_EMULATOR");
+    std::string word;
+    for (const char* c = text != nullptr ? text : ""; ; ++c) {
+        if (*c == ' ' || *c == '\0') {
+            if (!word.empty()) words.push_back(word);
+            word.clear();
+            if (*c == '\0') break;
+        } else {
+            word += *c;
+        }
+    }
+    return words;
+}
+
 }  // namespace
+
+std::vector<std::string> targetCommand(std::vector<std::string> argv) {
+    std::vector<std::string> command = emulator();
+    command.insert(command.end(), argv.begin(), argv.end());
+    return command;
+}
+
+std::string targetShellCommand(const std::string& program) {
+    std::string line;
+    for (const std::string& word : targetCommand({ program })) line += (line.empty() ? "" : " ") + word;
+    return line;
+}
+
+std::chrono::milliseconds scaled(std::chrono::milliseconds duration) {
+    const char* scale = std::getenv("BTBUS_TEST_TIME_SCALE");
+    int factor = scale != nullptr ? std::atoi(scale) : 1;
+    return duration * std::max(factor, 1);
+}
 
 // Forked rather than spawned so that the child is told to end when this
 // process does, even by a crash: a crashed test leaves no daemon behind.
@@ -85,7 +122,7 @@ int stop(pid_t pid, int signal, std::chrono::milliseconds grace) {
     if (pid <= 0) return -1;
     kill(pid, signal);
     int status = 0;
-    auto deadline = std::chrono::steady_clock::now() + grace;
+    auto deadline = std::chrono::steady_clock::now() + scaled(grace);
     while (std::chrono::steady_clock::now() < deadline) {
         pid_t done = waitpid(pid, &status, WNOHANG);
         if (done == pid) return status;
@@ -98,7 +135,7 @@ int stop(pid_t pid, int signal, std::chrono::milliseconds grace) {
 
 std::string readLine(int fd, std::chrono::milliseconds deadline) {
     std::string line;
-    auto end = std::chrono::steady_clock::now() + deadline;
+    auto end = std::chrono::steady_clock::now() + scaled(deadline);
     while (std::chrono::steady_clock::now() < end) {
         struct pollfd p = { fd, POLLIN, 0 };
         auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
@@ -113,7 +150,7 @@ std::string readLine(int fd, std::chrono::milliseconds deadline) {
 }
 
 bool waitUntil(const std::function<bool()>& predicate, std::chrono::milliseconds deadline) {
-    auto end = std::chrono::steady_clock::now() + deadline;
+    auto end = std::chrono::steady_clock::now() + scaled(deadline);
     while (true) {
         if (predicate()) return true;
         if (std::chrono::steady_clock::now() >= end) return false;
@@ -160,6 +197,37 @@ std::string scratchDir() {
         if (mkdtemp(&name[0]) != nullptr) dir = name;
     }
     return dir;
+}
+
+int runInChild(const std::string& filter, const std::string& role,
+               const std::vector<std::string>& wrapper) {
+    char self[4096];
+    ssize_t length = readlink("/proc/self/exe", self, sizeof self - 1);
+    if (length <= 0) return -1;
+    self[length] = '\0';
+    std::vector<std::string> argv = wrapper;
+    for (const std::string& word : targetCommand({ self })) argv.push_back(word);
+    argv.push_back("--gtest_filter=" + filter);
+    argv.push_back("--gtest_color=no");
+    std::vector<char*> args;
+    for (std::string& arg : argv) args.push_back(&arg[0]);
+    args.push_back(nullptr);
+    std::string roleVariable = "BTBUS_CHILD=" + role;
+    std::vector<char*> env;
+    for (char** e = environ; *e != nullptr; ++e)
+        if (std::strncmp(*e, "BTBUS_CHILD=", 12) != 0) env.push_back(*e);
+    env.push_back(&roleVariable[0]);
+    env.push_back(nullptr);
+    pid_t pid = -1;
+    if (posix_spawnp(&pid, args[0], nullptr, nullptr, args.data(), env.data()) != 0) return -1;
+    int status = 0;
+    if (waitpid(pid, &status, 0) != pid) return -1;
+    return status;
+}
+
+std::string childRole() {
+    const char* role = std::getenv("BTBUS_CHILD");
+    return role != nullptr ? role : "";
 }
 
 }  // namespace btbus_test

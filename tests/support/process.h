@@ -17,6 +17,16 @@ using namespace std::chrono_literals;
 // python3 first on PATH may not.
 constexpr const char* kDebianPython = "/usr/bin/python3";
 
+// In a cross-built run, programs built for the target run through an
+// emulator (BTBUS_TEST_EMULATOR: its words, separated by blanks), and every
+// deadline stretches by BTBUS_TEST_TIME_SCALE; natively these change nothing.
+// argv of a program built for the target, as this machine starts it.
+std::vector<std::string> targetCommand(std::vector<std::string> argv);
+// The same as one line for a shell.
+std::string targetShellCommand(const std::string& program);
+// A deadline or a duration a test expects, stretched for an emulated run.
+std::chrono::milliseconds scaled(std::chrono::milliseconds duration);
+
 // Starts argv[0] (looked up on PATH) with argv; its standard output goes to a
 // pipe whose read end is stored in *stdoutFd when that is given. Fails the
 // current test and returns -1 if it cannot be started.
@@ -29,7 +39,7 @@ int stop(pid_t pid, int signal = 15, std::chrono::milliseconds grace = 3000ms);
 // Reads one line from fd, waiting at most deadline; "" on time-out or end.
 std::string readLine(int fd, std::chrono::milliseconds deadline);
 
-// Polls predicate every 5 ms until it holds or deadline passes.
+// Polls predicate every 5 ms until it holds or deadline (scaled) passes.
 bool waitUntil(const std::function<bool()>& predicate, std::chrono::milliseconds deadline = 3000ms);
 
 // Whether name has an owner on the bus, asked through a private connection so
@@ -44,6 +54,15 @@ void requireDbusmock();
 
 // A directory for this test binary's files under the build tree's test-tmp.
 std::string scratchDir();
+
+// Runs this test binary again with only the test named filter, with
+// BTBUS_CHILD=role in its environment, optionally behind a wrapper command
+// (e.g. {"unshare", "-m"}); returns the child's exit status (0: all passed).
+// The child starts its own private buses.
+int runInChild(const std::string& filter, const std::string& role,
+               const std::vector<std::string>& wrapper = {});
+// The role this process was started with by runInChild, "" in the parent.
+std::string childRole();
 
 }  // namespace btbus_test
 

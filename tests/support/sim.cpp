@@ -201,35 +201,4 @@ bool receivingLoopRunning() { return gLoop != nullptr; }
 
 }  // namespace sim
 
-int runInChild(const std::string& filter, const std::string& role,
-               const std::vector<std::string>& wrapper) {
-    char self[4096];
-    ssize_t length = readlink("/proc/self/exe", self, sizeof self - 1);
-    if (length <= 0) return -1;
-    self[length] = '\0';
-    std::vector<std::string> argv = wrapper;
-    argv.push_back(self);
-    argv.push_back("--gtest_filter=" + filter);
-    argv.push_back("--gtest_color=no");
-    std::vector<char*> args;
-    for (std::string& arg : argv) args.push_back(&arg[0]);
-    args.push_back(nullptr);
-    std::string roleVariable = "BTBUS_CHILD=" + role;
-    std::vector<char*> env;
-    for (char** e = environ; *e != nullptr; ++e)
-        if (std::strncmp(*e, "BTBUS_CHILD=", 12) != 0) env.push_back(*e);
-    env.push_back(&roleVariable[0]);
-    env.push_back(nullptr);
-    pid_t pid = -1;
-    if (posix_spawnp(&pid, args[0], nullptr, nullptr, args.data(), env.data()) != 0) return -1;
-    int status = 0;
-    if (waitpid(pid, &status, 0) != pid) return -1;
-    return status;
-}
-
-std::string childRole() {
-    const char* role = std::getenv("BTBUS_CHILD");
-    return role != nullptr ? role : "";
-}
-
 }  // namespace btbus_test

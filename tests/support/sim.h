@@ -76,15 +76,6 @@ protected:
     void SetUp() override { ASSERT_TRUE(sim::start()); }
 };
 
-// Runs this test binary again with only the test named filter, with
-// BTBUS_CHILD=role in its environment, optionally behind a wrapper command
-// (e.g. {"unshare", "-m"}); returns the child's exit status (0: all passed).
-// The child starts its own private buses.
-int runInChild(const std::string& filter, const std::string& role,
-               const std::vector<std::string>& wrapper = {});
-// The role this process was started with by runInChild, "" in the parent.
-std::string childRole();
-
 }  // namespace btbus_test
 
 #endif

@@ -63,22 +63,23 @@ TEST_F(TheReceivingThreadBesideCalls, TimesOutABlockingCallThatGetsNoReply) {
 
 // Stopping is final for the whole process, so it runs in a child of its own.
 TEST(StoppingTheLoop, EndsEveryReceivingThreadAndThoseStartedLater) {
-    GTEST_FLAG_SET(death_test_style, "threadsafe");
-    EXPECT_EXIT(
-        {
-            Peer::ensureStarted();
-            auto first = peerObject();
-            auto second = peerObject(kOtherPath);
-            if (first->startLoop() != 0 || second->startLoop() != 0) _exit(2);
-            first->stopLoop();
-            if (first->waitLoop() != 0 || second->waitLoop() != 0) _exit(3);
-            auto later = peerObject();
-            if (later->startLoop() != 0 || later->waitLoop() != 0) _exit(4);
-            // A wait for a thread that is not there fails instead of crashing.
-            if (later->waitLoop() == 0) _exit(5);
-            std::exit(0);
-        },
-        ::testing::ExitedWithCode(0), "");
+    if (btbus_test::childRole() != "stop") {
+        EXPECT_EQ(btbus_test::runInChild("StoppingTheLoop.*", "stop"), 0);
+        return;
+    }
+    Peer::ensureStarted();
+    auto first = peerObject();
+    auto second = peerObject(kOtherPath);
+    ASSERT_EQ(first->startLoop(), 0);
+    ASSERT_EQ(second->startLoop(), 0);
+    first->stopLoop();
+    EXPECT_EQ(first->waitLoop(), 0);
+    EXPECT_EQ(second->waitLoop(), 0);
+    auto later = peerObject();
+    EXPECT_EQ(later->startLoop(), 0);
+    EXPECT_EQ(later->waitLoop(), 0);
+    // A wait for a thread that is not there fails instead of crashing.
+    EXPECT_NE(later->waitLoop(), 0);
 }
 
 }  // namespace

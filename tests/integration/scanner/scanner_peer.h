@@ -25,6 +25,7 @@ public:
     explicit Daemon(const std::vector<std::string>& args = {}) {
         std::vector<std::string> argv = { BTBUS_SCANNER };
         argv.insert(argv.end(), args.begin(), args.end());
+        argv = targetCommand(argv);
         pid_ = spawn(argv);
         EXPECT_TRUE(waitForName(DBUS_BUS_SESSION, kScannerName));
     }

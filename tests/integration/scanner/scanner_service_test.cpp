@@ -217,10 +217,10 @@ TEST_F(AScannerDaemon, SurvivesBadSignalsVanishingClientsAndAStormBesideEightCli
 }
 
 TEST(TheScannerDaemon, SaysWhatItDoesAndStartsDiscoveryForTheAdaptersItIsGiven) {
-    std::string help = shell(std::string(BTBUS_SCANNER) + " --help");
+    std::string help = shell(targetShellCommand(BTBUS_SCANNER) + " --help");
     EXPECT_NE(help.find("com.quillmar.bluetooth on the session bus"), std::string::npos) << help;
     EXPECT_NE(help.find("thirty seconds after the last discovery"), std::string::npos) << help;
-    EXPECT_NE(shell(std::string(BTBUS_SCANNER) + " --bogus; echo status $?").find("status 2"), std::string::npos);
+    EXPECT_NE(shell(targetShellCommand(BTBUS_SCANNER) + " --bogus; echo status $?").find("status 2"), std::string::npos);
     ASSERT_TRUE(sim::start());
     Daemon daemon({ "hci9", "hci0" });
     EXPECT_TRUE(sim::waitForLogLine(sim::defaultAdapterPath() + " org.bluez.Adapter.StartDiscovery()"));
