@@ -54,6 +54,18 @@ public:
     int setAdapterRemovedHandler(AdapterPathHandler handler);
     int setDefaultAdapterChangedHandler(AdapterPathHandler handler);
 
+    // bluetoothd's comings and goings: handler(this Manager, running) is
+    // called with false when bluetoothd leaves the system bus and with true
+    // when a bluetoothd takes "org.bluez" again, as after restartBluetoothd.
+    // A new daemon has new adapter paths and knows nothing of the old one's
+    // agent registrations, sessions and discoveries: redo them then. Runs on
+    // the receiving thread, like the signal handlers, until this Manager is
+    // destroyed; null installs the default handler below. 0, or -1 when the
+    // bus refuses the watch (logged).
+    int setBluetoothdHandler(void (*handler)(RemoteObject* manager, bool running));
+    // "bluetoothd left the system bus" / "bluetoothd is on the system bus"
+    static void bluetoothdHandler(RemoteObject* manager, bool running);
+
     // "<adapter> was added by <manager path>"
     static void adapterAddedHandler(RemoteObject* object, const ObjectPath* path);
     // "<adapter> was removed by <manager path>"

@@ -1,9 +1,11 @@
 #include <bluetooth/manager.h>
 
+#include <iostream>
 #include <memory>
 
 #include "bluez/signal_line.h"
 #include "core/call.h"
+#include "core/owner_watch.h"
 
 BT_LOG_FILE("manager.cpp");
 
@@ -81,6 +83,14 @@ int Manager::setAdapterRemovedHandler(AdapterPathHandler handler) {
 int Manager::setDefaultAdapterChangedHandler(AdapterPathHandler handler) {
     return setSignalHandlerObjectPath(kSignals[kDefaultChanged].signal,
                                       handler != 0 ? handler : &defaultAdapterChangedHandler);
+}
+
+int Manager::setBluetoothdHandler(void (*handler)(RemoteObject* manager, bool running)) {
+    return internal::watchOwner(*this, "org.bluez", handler != 0 ? handler : &bluetoothdHandler);
+}
+
+void Manager::bluetoothdHandler(RemoteObject*, bool running) {
+    std::cout << (running ? "bluetoothd is on the system bus" : "bluetoothd left the system bus") << std::endl;
 }
 
 void Manager::adapterAddedHandler(RemoteObject* object, const ObjectPath* path) {

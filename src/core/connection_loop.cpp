@@ -15,6 +15,7 @@
 
 #include "core/dbus_holders.h"
 #include "core/log.h"
+#include "core/owner_watch.h"
 
 BT_LOG_FILE("connection_loop.cpp");
 
@@ -364,6 +365,7 @@ void ConnectionLoop::runWork(Work& work) {
             if (owner != 0) beginUseLocked(owner);
         }
         if (!stopped()) {
+            dispatchOwnerChange(work.message);
             RemoteObject::signalHandlerDispatcherObjectPath(owner, work.message);
             RemoteObject::signalHandlerDispatcherStringVariant(owner, work.message);
             RemoteObject::signalHandlerDispatcherString(owner, work.message);

@@ -8,6 +8,7 @@
 #include "core/dbus_holders.h"
 #include "core/decode.h"
 #include "core/log.h"
+#include "core/owner_watch.h"
 
 BT_LOG_FILE("remote_object.cpp");
 
@@ -158,6 +159,7 @@ void RemoteObject::releaseHandlers() {
         dbus_bus_remove_match(connection, rules[i].c_str(), error.get());
         if (error.isSet()) BT_LOG_ERR("Remove match error (%s)", error.text());
     }
+    internal::unwatchOwners(*this);
     internal::ConnectionLoop::forgetOwner(this);
     internal::waitUnused(this);
 }

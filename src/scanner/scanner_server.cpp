@@ -57,11 +57,14 @@ struct ScannerServer::Service {
     // registered, and makes it a founder; null when BlueZ does not know it.
     static Adapter* startFounder(ScannerServer& server, const char* name) {
         Adapter* adapter = findAdapter(server, name);
-        if (adapter == 0) return 0;
-        adapter->startDiscovery();
-        adapter->setDeviceFoundHandler(&scannerDeviceFound);
-        adapter->setDeviceDisappearedHandler(&scannerDeviceDisappeared);
+        if (adapter != 0) discover(*adapter);
         return adapter;
+    }
+
+    static void discover(Adapter& adapter) {
+        adapter.startDiscovery();
+        adapter.setDeviceFoundHandler(&scannerDeviceFound);
+        adapter.setDeviceDisappearedHandler(&scannerDeviceDisappeared);
     }
 
     static void addFounderLocked(ScannerServer& server, Adapter* adapter) {
@@ -162,6 +165,85 @@ struct ScannerServer::Service {
         Hold hold(server->stateLock);
         AddressSet* set = finderLocked(*server->object, name);
         if (set != 0) set->erase(address);
+    }
+
+    // Discovery again on an adapter that BlueZ has anew, for a finder that
+    // wants it; no new countdown, as no finder was created.
+    // Runs on the receiving thread only, so two never start the same.
+    static void restartFinder(ScannerServer& server, const std::string& name) {
+        {
+            Hold hold(server.stateLock);
+            if (finderLocked(*server.object, name) == 0) return;
+        }
+        // None: it is gone, and its finder stays empty until it returns.
+        std::unique_ptr<Adapter> adapter(findAdapter(server, name.c_str()));
+        if (!adapter) return;
+        {
+            // The new daemon announces its adapters as it comes up.
+            Hold hold(server.stateLock);
+            for (size_t i = 0; i < server.founders->size(); ++i)
+                if ((*server.founders)[i] != 0 && strcmp((*server.founders)[i]->getPath(), adapter->getPath()) == 0)
+                    return;
+        }
+        discover(*adapter);
+        Hold hold(server.stateLock);
+        server.founders->push_back(adapter.release());
+    }
+
+    // The adapters of path (all, when null) are gone, and with them what they
+    // found: a daemon that is gone can no longer report it disappeared. The
+    // information texts stay.
+    static void dropFounders(ScannerServer& server, const char* path) {
+        AdapterList gone;
+        {
+            Hold hold(server.stateLock);
+            for (AdapterList* list : { server.founders, &server.retired }) {
+                for (AdapterList::iterator it = list->begin(); it != list->end();) {
+                    if (*it != 0 && path != 0 && strcmp((*it)->getPath(), path) != 0) {
+                        ++it;
+                        continue;
+                    }
+                    gone.push_back(*it);
+                    it = list->erase(it);
+                }
+            }
+            for (FinderTable::iterator it = server.object->finders->begin(); it != server.object->finders->end(); ++it)
+                if (path == 0 || it->first == adapterNameFromPath(path)) it->second->clear();
+        }
+    }  // gone deletes the proxies, and their callbacks with them
+
+    // bluetoothd left or came back (a restart: new adapter paths): every
+    // finder starts over on the new daemon's adapter of the same name.
+    static void bluetoothdChanged(RemoteObject*, bool running) {
+        internal::guarded(kLogFile, __LINE__, "bluetoothd's restart", [running] {
+            ScannerServer* server = current();
+            if (server == 0 || server->object == 0) return;
+            dropFounders(*server, 0);
+            if (!running) return;
+            std::vector<std::string> names;
+            {
+                Hold hold(server->stateLock);
+                for (FinderTable::iterator it = server->object->finders->begin();
+                     it != server->object->finders->end(); ++it)
+                    names.push_back(it->first);
+            }
+            for (size_t i = 0; i < names.size(); ++i) restartFinder(*server, names[i]);
+        });
+    }
+
+    static void adapterAdded(RemoteObject*, const ObjectPath* path) {
+        internal::guarded(kLogFile, __LINE__, "AdapterAdded", [path] {
+            ScannerServer* server = current();
+            if (server != 0 && server->object != 0 && path != 0)
+                restartFinder(*server, adapterNameFromPath(path->c_str()));
+        });
+    }
+
+    static void adapterRemoved(RemoteObject*, const ObjectPath* path) {
+        internal::guarded(kLogFile, __LINE__, "AdapterRemoved", [path] {
+            ScannerServer* server = current();
+            if (server != 0 && server->object != 0 && path != 0) dropFounders(*server, path->c_str());
+        });
     }
 
     static gboolean listDevices(ScannerObject* object, const char* arg0, GHashTable** arg1,
@@ -341,6 +423,12 @@ ScannerServer::ScannerServer()
     if (object == 0 || manager == 0 || !prepared)
         internal::logError(kLogFile, kInitialLogLine, "Failed to initial the ScannerServer");
     updateFilterSet();
+    // A new bluetoothd, or an adapter that comes and goes, restarts the finders.
+    if (manager != 0) {
+        manager->setBluetoothdHandler(&Service::bluetoothdChanged);
+        manager->setAdapterAddedHandler(&Service::adapterAdded);
+        manager->setAdapterRemovedHandler(&Service::adapterRemoved);
+    }
     gServer.store(this);
 }
 

@@ -96,8 +96,9 @@ bool start() {
             kill();
             return false;
         }
+    } else {
+        reset();  // a new one starts from the starting scene anyway
     }
-    reset();
     return !::testing::Test::HasFailure();
 }
 

@@ -48,3 +48,8 @@ def load(mock, parameters):
     mock.bluez4_sim = sim
     sim.export(MAIN_OBJ, MANAGER, ManagerInterface(sim))
     sim.export(CONTROL_PATH, CONTROL_IFACE, ControlPanel(sim), logged=False)
+    if previous is None:
+        # As bluetoothd does on start, after it took its name: a program that
+        # saw the daemon come back learns its adapters' new paths.
+        for path in sim.adapter_paths():
+            sim.emit('/', MANAGER, 'AdapterAdded', 'o', path)

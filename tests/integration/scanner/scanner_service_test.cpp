@@ -75,6 +75,26 @@ TEST_F(AScannerDaemon, FollowsDiscoveryPairingAndDevicesGoingOutOfRange) {
     EXPECT_TRUE(listsExactly("hci0", { kHeadset, kKeyboard }));
 }
 
+// A new bluetoothd has new adapter paths and has found nothing yet; an
+// adapter it lacks leaves its finder empty until it comes.
+TEST_F(AScannerDaemon, StartsOverOnTheAdaptersOfANewBluetoothd) {
+    using sim::kHeadset, sim::kKeyboard, sim::kPhone;
+    std::string hci1 = sim::addAdapter("hci1", "00:1A:7D:DA:71:99");
+    EXPECT_TRUE(listsExactly("hci0", { kHeadset, kKeyboard, kPhone }));
+    callScanner("ListDevices", "hci1");
+    found(hci1, kAddress, "{}");
+    EXPECT_TRUE(listsExactly("hci1", { kAddress }));
+    sim::kill();
+    ASSERT_TRUE(sim::start());
+    sim::setInRange("hci0", kKeyboard, false);
+    EXPECT_TRUE(sim::waitForLogLine(sim::defaultAdapterPath() + " org.bluez.Adapter.StartDiscovery()"));
+    EXPECT_TRUE(listsExactly("hci0", { kHeadset, kPhone }));
+    EXPECT_EQ(callScanner("ListDevices", "hci1").error, "Adapter hci1 not found");
+    hci1 = sim::addAdapter("hci1", "00:1A:7D:DA:71:99");
+    EXPECT_TRUE(sim::waitForLogLine(hci1 + " org.bluez.Adapter.StartDiscovery()"));
+    EXPECT_EQ(callScanner("ListDevices", "hci1").devices, (Devices{ { "", "" } }));
+}
+
 TEST_F(AScannerDaemon, RemovesFindersAndAnswersErrorsWithTheCallersArgument) {
     std::string hci1 = sim::addAdapter("hci1", "00:1A:7D:DA:71:99");
     const struct {
