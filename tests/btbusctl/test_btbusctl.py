@@ -8,7 +8,10 @@ import os
 import signal
 import subprocess
 import tempfile
+import threading
 import unittest
+
+import dbus
 
 from simharness import SimTestCase, run_until
 
@@ -217,6 +220,50 @@ class BtbusctlTest(SimTestCase):
         self.assertEqual(seen.count(('Connected', 'AudioSink', None, headset)), 1)
         self.assertEqual([e['value'] for e in events if e.get('name') == 'State' and 'Sink' in e['interface']],
                          ['connecting', 'connected'])
+
+    def events_until(self, proc, done, timeout=10):
+        """The JSON events proc prints, up to the first for which done() holds."""
+        seen = []
+
+        def read():
+            for line in proc.stdout:
+                seen.append(json.loads(line))
+                if done(seen[-1]):
+                    return
+        reader = threading.Thread(target=read, daemon=True)
+        reader.start()
+        reader.join(timeout)
+        self.assertFalse(reader.is_alive(), f'not yet seen; seen: {seen}')
+        return seen
+
+    def test_agent_watch_and_scan_carry_on_when_bluetoothd_restarts(self):
+        procs = {name: self.start(*args) for name, args in
+                 (('agent', ('agent', '--pin', '0000')), ('watch', ('watch',)), ('scan', ('scan', '--timeout', '0')))}
+        old, new = ({'address': '00:AA:00:00:00:0%d' % i, 'name': 'Thing'} for i in (1, 2))
+        self.control('AddDevice', 'hci0', json.dumps(old))
+        self.events_until(procs['scan'], lambda e: e.get('address') == old['address'])
+        before = self.adapter
+        os.kill(self.launcher.proc.pid, signal.SIGHUP)  # a new bluetoothd: new paths, its own scene
+        def default_adapter():
+            try:
+                return self.call('/', 'org.bluez.Manager', 'DefaultAdapter')
+            except dbus.DBusException:  # gone, or not up yet
+                return before
+        self.assertTrue(run_until(lambda: default_adapter() != before, 10))
+        self.adapter = default_adapter()
+        for name, proc in procs.items():
+            with self.subTest(restarted=name):
+                self.assertEqual(self.events_until(proc, lambda e: e['event'] == 'restarted')[-1]['adapter'], 'hci0')
+        self.control('AddDevice', 'hci0', json.dumps(new))
+        found = self.events_until(procs['scan'], lambda e: e.get('address') == new['address'])
+        self.assertNotIn(old['address'], [e.get('address') for e in found])
+        self.assertEqual(self.control('StartIncomingPairing', 'hci0', KEYBOARD), 'accepted')
+        self.assertEqual(self.events_until(procs['agent'], lambda e: e['event'] == 'request')[-1]['request'],
+                         'RequestPinCode')
+        self.events_until(procs['watch'], lambda e: e['event'] == 'DeviceCreated' and e['path'] == self.adapter)
+        for proc in procs.values():
+            proc.send_signal(signal.SIGINT)
+            self.assertEqual(proc.wait(10), 0)
 
 
 if __name__ == '__main__':

@@ -180,12 +180,13 @@ int scan(const Options& options, int seconds) {
     gScan.out = &out;
     chosen->setDeviceFoundHandler(&deviceFound);
     chosen->setDeviceDisappearedHandler(&deviceDisappeared);
-    chosen->startLoop();
+    watchRestarts(*bluez);
+    bluez->startLoop();
     if (chosen->startDiscovery() != 0) throw failed("StartDiscovery", *chosen);
     // Sent without waiting: a refusal (adapter off) only shows as no discovery.
     if (!waitUntil([&] { return discovering(*chosen); }, std::chrono::seconds(3))) {
-        chosen->stopLoop();
-        chosen->waitLoop();
+        bluez->stopLoop();
+        bluez->waitLoop();
         Dict props = properties(*chosen);
         const Variant* powered = lookup(props, "Powered");
         throw Failure("discovery did not start on " + shortName(chosen->getPath()) +
@@ -202,12 +203,25 @@ int scan(const Options& options, int seconds) {
         text << " (Ctrl-C stops)";
         out.progress(text.str());
         if (waitForStop(std::chrono::milliseconds(250))) break;
+        if (!restarted()) continue;
+        // The new daemon's adapter has a new path, and discovers nothing yet.
+        std::unique_ptr<Adapter> again = adapterAfterRestart(*bluez, options);
+        if (!again) continue;
+        chosen = std::move(again);  // the old proxy's handlers go with it
+        {
+            std::lock_guard<std::mutex> hold(gScan.lock);
+            gScan.present.clear();
+        }
+        chosen->setDeviceFoundHandler(&deviceFound);
+        chosen->setDeviceDisappearedHandler(&deviceDisappeared);
+        chosen->startDiscovery();
+        reportRestart(out, *chosen, "scanning on " + shortName(chosen->getPath()) + " again");
     }
     out.progress("");
     chosen->stopDiscovery();
     settle(*chosen);
-    chosen->stopLoop();
-    chosen->waitLoop();
+    bluez->stopLoop();
+    bluez->waitLoop();
     gScan.out = 0;
     return kOk;
 }

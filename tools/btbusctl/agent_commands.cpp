@@ -129,7 +129,8 @@ int standingAgent(const Options& options, const AgentOptions& settings) {
     Output out(options);
     gRequests.out = &out;
     ServedAgent agent(settings);
-    chosen->startLoop();  // its thread dispatches the bus, so it serves the agent
+    watchRestarts(*bluez);
+    bluez->startLoop();  // its thread dispatches the bus, so it serves the agent
     if (chosen->registerAgent(*agent) != 0) throw failed("RegisterAgent", *chosen);
     properties(*chosen);  // RegisterAgent was sent without waiting: now it has arrived
     std::string adapterName = shortName(chosen->getPath());
@@ -139,11 +140,19 @@ int standingAgent(const Options& options, const AgentOptions& settings) {
     else
         out.print("agent " + std::string(agent->getPath()) + " (" + settings.capability +
                   ") offered to " + adapterName + "; answering until interrupted");
-    waitForStop(std::chrono::milliseconds(0));
+    while (!waitForStop(std::chrono::milliseconds(100))) {
+        if (!restarted()) continue;
+        // The new daemon knows nothing of the agent: offer it again.
+        std::unique_ptr<Adapter> again = adapterAfterRestart(*bluez, options);
+        if (!again || again->registerAgent(*agent) != 0) continue;
+        chosen = std::move(again);
+        properties(*chosen);
+        reportRestart(out, *chosen, "agent offered to " + shortName(chosen->getPath()) + " again");
+    }
     chosen->unregisterAgent(*agent);
     settle(*chosen);
-    chosen->stopLoop();
-    chosen->waitLoop();
+    bluez->stopLoop();
+    bluez->waitLoop();
     if (!options.json) out.print("agent unregistered");
     return kOk;
 }

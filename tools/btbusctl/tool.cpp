@@ -104,6 +104,36 @@ std::unique_ptr<Adapter> adapter(Manager& manager, const Options& options) {
     return found;
 }
 
+namespace {
+std::atomic<int> gRestarts{0};
+void onBluetoothd(RemoteObject*, bool running) {
+    if (running) ++gRestarts;
+}
+}  // namespace
+
+void watchRestarts(Manager& manager) {
+    if (manager.setBluetoothdHandler(&onBluetoothd) != 0) throw Failure("cannot follow bluetoothd on the system bus");
+}
+
+bool restarted() { return gRestarts.exchange(0) > 0; }
+
+std::unique_ptr<Adapter> adapterAfterRestart(Manager& manager, const Options& options) {
+    for (int tries = 0; tries < 50 && !stopRequested(); ++tries) {
+        Adapter* found = options.adapter.empty() ? manager.defaultAdapter()
+                                                 : manager.findAdapter(options.adapter.c_str());
+        if (found != 0) return std::unique_ptr<Adapter>(found);
+        std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    }
+    return nullptr;
+}
+
+void reportRestart(Output& out, const Adapter& adapter, const std::string& now) {
+    if (out.jsonMode())
+        out.print(json{{"event", "restarted"}, {"adapter", shortName(adapter.getPath())}});
+    else
+        out.print("bluetoothd restarted: " + now);
+}
+
 std::pair<std::string, std::string> adapterIdentity(const Options& options) {
     std::unique_ptr<Manager> bluez = manager();
     std::unique_ptr<Adapter> chosen = adapter(*bluez, options);

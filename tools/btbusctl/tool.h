@@ -72,6 +72,18 @@ bool stopRequested();  // one arrived and was not consumed yet; does not wait
 std::unique_ptr<Bluetooth::Manager> manager();
 // The adapter that -a names, else BlueZ's default one.
 std::unique_ptr<Bluetooth::Adapter> adapter(Bluetooth::Manager& manager, const Options& options);
+// bluetoothd restarts (restartBluetoothd does one when an adapter is attached):
+// watchRestarts has manager's receiving thread count them; restarted() tells
+// the main thread once of those since it last asked. A new daemon has new
+// adapter paths and knows nothing of the old one's agent and discovery.
+void watchRestarts(Bluetooth::Manager& manager);
+bool restarted();
+// The adapter of -a on a bluetoothd that has just started, which announces
+// its adapters as it comes up: waits a little for it. Null when it does not
+// come, or a stop was asked for meanwhile.
+std::unique_ptr<Bluetooth::Adapter> adapterAfterRestart(Bluetooth::Manager& manager, const Options& options);
+// "bluetoothd restarted: <what now>", or a JSON event "restarted".
+void reportRestart(Output& out, const Bluetooth::Adapter& adapter, const std::string& now);
 // The name ("hci0") and address of the adapter that -a names, else of the default one.
 std::pair<std::string, std::string> adapterIdentity(const Options& options);
 // "hci0" for ".../hci0"; "00:11:.." for ".../dev_00_11_..".

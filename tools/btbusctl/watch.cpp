@@ -152,12 +152,16 @@ int watch(const Options& options) {
     control->setConnectedHandler(&onSignal<kControl, kConnected>);
     control->setDisconnectedHandler(&onSignal<kControl, kDisconnected>);
     for (BluezObject* proxy : proxies) proxy->setPropertyChangedHandler(&onProperty);
+    // One rule for every signal of org.bluez, whoever owns it: a new daemon's
+    // adapters and devices are watched as the old one's were.
+    watchRestarts(*bluez);
     chosen->startLoop();
     if (options.json)
         out.print(json{{"event", "watching"}, {"path", chosen->getPath()}});
     else
         out.print("watching bluetoothd's adapters and devices (Ctrl-C stops)");
-    waitForStop(std::chrono::milliseconds(0));
+    while (!waitForStop(std::chrono::milliseconds(100)))
+        if (restarted()) reportRestart(out, *chosen, "watching its adapters and devices");
     chosen->stopLoop();
     chosen->waitLoop();
     dbus_bus_remove_match(bus, kEveryBluezSignal, 0);
