@@ -174,7 +174,7 @@ class BtbusctlTest(SimTestCase):
         events = []
         for line in scan.stdout:
             events.append(json.loads(line))
-            if (events[-1]['event'], events[-1]['address']) == ('found', PHONE):
+            if (events[-1]['event'], events[-1].get('address')) == ('found', PHONE):
                 self.control('SetInRange', 'hci0', PHONE, False)
         self.assertEqual(scan.wait(10), 0)
         found = sorted(e['address'] for e in events if e['event'] == 'found')
@@ -240,6 +240,8 @@ class BtbusctlTest(SimTestCase):
         procs = {name: self.start(*args) for name, args in
                  (('agent', ('agent', '--pin', '0000')), ('watch', ('watch',)), ('scan', ('scan', '--timeout', '0')))}
         old, new = ({'address': '00:AA:00:00:00:0%d' % i, 'name': 'Thing'} for i in (1, 2))
+        for name, first in (('agent', 'registered'), ('watch', 'watching'), ('scan', 'scanning')):
+            self.events_until(procs[name], lambda e, first=first: e['event'] == first)
         self.control('AddDevice', 'hci0', json.dumps(old))
         self.events_until(procs['scan'], lambda e: e.get('address') == old['address'])
         before = self.adapter

@@ -18,6 +18,8 @@ public:
     void TearDown() override;
     static const std::string& systemAddress();
     static const std::string& sessionAddress();
+    // Kills the session bus's daemon (SIGKILL), as a session that ends at once.
+    static void killSessionBus();
 };
 
 }  // namespace btbus_test

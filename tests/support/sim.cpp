@@ -1,5 +1,6 @@
 #include "support/sim.h"
 
+#include <csignal>
 #include <cstdlib>
 #include <cstring>
 #include <memory>
@@ -107,6 +108,10 @@ void kill() {
     stop(gSim, SIGKILL);
     gSim = -1;
     waitUntil([] { return !nameHasOwner(DBUS_BUS_SYSTEM, "org.bluez"); });
+}
+
+void freeze(bool frozen) {
+    if (gSim > 0) ::kill(gSim, frozen ? SIGSTOP : SIGCONT);
 }
 
 void reset() { control("Reset", &noReply); }

@@ -26,6 +26,9 @@ bool start();
 // "org.bluez" has no owner.
 void kill();
 bool running();
+// Freezes the simulator (SIGSTOP), as a hung bluetoothd: it neither answers
+// nor leaves the bus; or thaws it (SIGCONT).
+void freeze(bool frozen);
 
 // The devices of the default scene (tools/bluez4-sim/default-scene.json).
 constexpr const char kHeadset[] = "00:0D:3C:A1:B2:C3";    // audio sink and remote control

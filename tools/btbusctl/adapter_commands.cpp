@@ -192,6 +192,7 @@ int scan(const Options& options, int seconds) {
         throw Failure("discovery did not start on " + shortName(chosen->getPath()) +
                       (powered && !variantToBool(*powered) ? ": the adapter is off" : ""));
     }
+    if (options.json) out.print(json{{"event", "scanning"}, {"adapter", shortName(chosen->getPath())}});
     auto end = std::chrono::steady_clock::now() + std::chrono::seconds(seconds);
     while (seconds == 0 || std::chrono::steady_clock::now() < end) {
         std::ostringstream text;

@@ -1,6 +1,9 @@
-// A rogue peer's odd signals, and bluetoothd going away between and during calls.
+// A rogue peer's odd signals, and bluetoothd going away between calls, dying or
+// hanging during them.
+#include <algorithm>
 #include <atomic>
 #include <chrono>
+#include <functional>
 #include <memory>
 #include <string>
 #include <thread>
@@ -106,35 +109,78 @@ TEST_F(SimTest, AProxyFailsCleanlyWhenBluetoothdIsGoneBetweenCalls) {
     EXPECT_EQ(Adapter::getAdapter(path.c_str()), nullptr);
 }
 
-std::atomic<bool> gAsked{ false };
-DBusHandlerResult noteAsked(DBusConnection* connection, DBusMessage* message, void* agent) {
-    gAsked = true;
-    return Agent::handlerDispatcher(connection, message, agent);
+std::atomic<int> gFound{ 0 };
+void countFound(RemoteObject*, const char*, const Dict*) { ++gFound; }
+
+// bluetoothd hangs or dies while a blocking call and a pairing (a pending call
+// that serves the agent) wait, each on a thread of its own, and discovery runs
+// beside the receiving thread.
+class ABluetoothdInTrouble : public SimTest {
+protected:
+    void SetUp() override {
+        SimTest::SetUp();
+        sim::receivingLoop();
+        adapter.reset(Adapter::getAdapter(sim::defaultAdapterPath().c_str()));
+        ASSERT_NE(adapter, nullptr);
+        ASSERT_EQ(agent.registerPath(), 0);
+        discover(*adapter);
+    }
+    void TearDown() override { agent.unregisterPath(); }
+
+    static void discover(Adapter& on) {
+        int before = gFound;
+        ASSERT_EQ(on.setDeviceFoundHandler(&countFound), 0);
+        ASSERT_EQ(on.startDiscovery(), 0);
+        EXPECT_TRUE(waitUntil([before] { return gFound > before; }, 10s)) << "no discovery";
+    }
+
+    // How long the blocking call and the pairing waited, sent to a frozen
+    // bluetoothd before what happens meanwhile; both fail with error 11.
+    std::vector<std::chrono::steady_clock::duration> waitsWhile(const std::function<void()>& meanwhile) {
+        std::vector<std::chrono::steady_clock::duration> waits(2);
+        std::unique_ptr<Adapter> caller(Adapter::getAdapter(adapter->getPath()));  // a proxy per thread
+        sim::freeze(true);
+        auto timed = [&waits](size_t i, Adapter* on, const std::function<bool()>& failed) {
+            auto start = std::chrono::steady_clock::now();
+            EXPECT_TRUE(failed());
+            waits[i] = std::chrono::steady_clock::now() - start;
+            EXPECT_EQ(on->getErrorNumber(), 11);
+        };
+        std::thread call(timed, 0, caller.get(), [&] { return std::unique_ptr<Dict>(caller->getProperties()) == nullptr; });
+        std::thread pairing(timed, 1, adapter.get(),
+                            [&] { return std::unique_ptr<Device>(adapter->createPairedDevice(sim::kKeyboard, agent)) == nullptr; });
+        std::this_thread::sleep_for(300ms);
+        meanwhile();
+        call.join();
+        pairing.join();
+        return waits;
+    }
+
+    std::unique_ptr<Adapter> adapter;
+    Agent agent;
+};
+
+TEST_F(ABluetoothdInTrouble, ThatHangsEndsTheWaitsAtTheDefaultTimeOutAndServesAgainWhenItWakes) {
+    for (auto waited : waitsWhile([] {})) {
+        EXPECT_GE(waited, 24s);
+        EXPECT_LT(waited, btbus_test::scaled(35s));
+    }
+    int before = gFound;
+    sim::freeze(false);
+    EXPECT_TRUE(waitUntil([before] { return gFound > before; }, 10s)) << "discovery did not go on";
+    EXPECT_TRUE(std::unique_ptr<Dict>(adapter->getProperties()) != nullptr);
 }
 
-TEST_F(SimTest, APairingFailsCleanlyWhenBluetoothdDiesDuringIt) {
-    std::unique_ptr<Adapter> adapter(Adapter::getAdapter(sim::defaultAdapterPath().c_str()));
-    ASSERT_NE(adapter, nullptr);
-    Agent agent;
-    ASSERT_EQ(agent.setDispatcher(&noteAsked), 0);
-    ASSERT_EQ(agent.setPasskeyValue("0000"), 0);
-    ASSERT_EQ(agent.setPasskeyDelay(1), 0);
-    ASSERT_EQ(agent.registerPath(), 0);
-    gAsked = false;
-    std::thread killer([] {
-        EXPECT_TRUE(waitUntil([] { return gAsked.load(); }));
-        sim::kill();  // while the agent thinks
-    });
+TEST_F(ABluetoothdInTrouble, ThatDiesEndsTheWaitsAtOnceAndANewOneServes) {
     LogCapture log;
-    auto start = std::chrono::steady_clock::now();
-    EXPECT_EQ(adapter->createPairedDevice("00:12:A1:B0:00:42", agent), nullptr);
-    auto took = std::chrono::steady_clock::now() - start;
-    killer.join();
-    EXPECT_EQ(adapter->getErrorNumber(), 11);
-    EXPECT_FALSE(adapter->getErrorMessage().empty());
-    EXPECT_EQ(log.lines(), std::vector<std::string>{ "adapter.cpp:312 " + adapter->getErrorMessage() });
-    EXPECT_LT(took, btbus_test::scaled(10s)) << "waited for a time-out instead of the bus's notice";
-    EXPECT_EQ(agent.unregisterPath(), 0);
+    for (auto waited : waitsWhile([] { sim::kill(); }))
+        EXPECT_LT(waited, btbus_test::scaled(5s)) << "waited for a time-out instead of the bus's notice";
+    const std::vector<std::string> lines = log.lines();
+    EXPECT_EQ(std::count(lines.begin(), lines.end(), "adapter.cpp:312 " + adapter->getErrorMessage()), 1);
+    ASSERT_TRUE(sim::start());
+    std::unique_ptr<Adapter> fresh(Adapter::getAdapter(sim::defaultAdapterPath().c_str()));
+    ASSERT_NE(fresh, nullptr);
+    discover(*fresh);
 }
 
 }  // namespace

@@ -9,7 +9,10 @@
 
 #include <bluetooth/btbus.h>
 
+#include <sys/wait.h>
+
 #include "integration/scanner/scanner_peer.h"
+#include "support/private_buses.h"
 #include "support/sim.h"
 
 namespace {
@@ -234,6 +237,28 @@ TEST_F(AScannerDaemon, SurvivesBadSignalsVanishingClientsAndAStormBesideEightCli
     dbus_connection_close(bus);
     dbus_connection_unref(bus);
     EXPECT_EQ(failures, 0);
+}
+
+// In a child of its own, whose session bus dies while a client asks.
+TEST(TheScannerDaemon, EndsWithoutACrashWhenItsSessionBusDies) {
+    if (childRole() != "bus-dies") {
+        EXPECT_EQ(runInChild("TheScannerDaemon.EndsWithoutACrash*", "bus-dies"), 0);
+        return;
+    }
+    ASSERT_TRUE(sim::start());
+    pid_t daemon = spawn(targetCommand({ BTBUS_SCANNER, "hci0" }));
+    ASSERT_TRUE(waitForName(DBUS_BUS_SESSION, kScannerName));
+    std::atomic<bool> asking{ true };
+    std::thread client([&] {
+        while (asking) callScanner("ListDevices", "hci0");
+    });
+    std::this_thread::sleep_for(300ms);
+    PrivateBuses::killSessionBus();
+    int status = 0;
+    EXPECT_TRUE(waitUntil([&] { return waitpid(daemon, &status, WNOHANG) == daemon; }, 10s));
+    EXPECT_TRUE(WIFEXITED(status)) << "ended by signal " << WTERMSIG(status);
+    asking = false;
+    client.join();
 }
 
 TEST(TheScannerDaemon, SaysWhatItDoesAndStartsDiscoveryForTheAdaptersItIsGiven) {
