@@ -9,6 +9,7 @@
 #include <bluetooth/hci.h>
 #include <bluetooth/hci_lib.h>
 #include <glob.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include "core/log.h"
@@ -69,9 +70,26 @@ int findProcessId(const char* fragment) {
 
 }  // namespace internal
 
+namespace {
+
+// A marker is a regular file of this user's or root's: a link or a file that
+// another user left in the shared /tmp marks no adapter.
+bool anAdapterIsAttached() {
+    Glob markers(kAdapterMarkers);
+    for (size_t i = 0; i < markers.size(); ++i) {
+        struct stat marker;
+        if (lstat(markers[i], &marker) == 0 && S_ISREG(marker.st_mode) &&
+            (marker.st_uid == 0 || marker.st_uid == geteuid()))
+            return true;
+    }
+    return false;
+}
+
+}  // namespace
+
 int restartBluetoothd() {
     int pid = internal::findProcessId(kDaemonName);
-    if (Glob(kAdapterMarkers).size() == 0) {
+    if (!anAdapterIsAttached()) {
         BT_LOG_ERR("No dongle. Stop restarting bluetoothd...");
         return -1;
     }

@@ -24,7 +24,9 @@ int openPipe(const char* path, int flags) {
         return -1;
     }
     if (mkfifo(path, 0666) != 0 && errno != EEXIST) return -1;
-    return open(path, flags);  // a regular file already at path is opened as it is
+    // A regular file already at path is opened as it is; a symbolic link, which
+    // another user could have planted in /tmp, is not followed.
+    return open(path, flags | O_NOFOLLOW | O_CLOEXEC);
 }
 
 // A write into a pipe whose reader has gone raises SIGPIPE, which would end the

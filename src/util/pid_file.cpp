@@ -28,7 +28,10 @@ int fail(int fd) {
 // PID file" is logged only on failure.
 int createPidFile(const char* path, int flags, bool reportRunning) {
     // Not truncated yet: a refused lock must leave the other instance's id.
-    int fd = path != 0 ? open(path, O_RDWR | O_CREAT, 0600) : -1;
+    // A symbolic link at path is refused: it could send the write anywhere.
+    // Close-on-exec from the start when asked, so that no exec on another
+    // thread inherits it meanwhile.
+    int fd = path != 0 ? open(path, O_RDWR | O_CREAT | O_NOFOLLOW | ((flags & 1) ? O_CLOEXEC : 0), 0600) : -1;
     if (fd < 0) {
         BT_LOG_ERR("Could not open PID file %s", path != 0 ? path : "(null)");
         return -1;

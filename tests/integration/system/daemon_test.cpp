@@ -94,6 +94,12 @@ TEST(RestartingBluetoothd, NeedsAnAttachedAdapterAndKillsTheOldDaemon) {
         EXPECT_EQ(now > 0 && now != old, row.result == 0);
         killDaemons();
     }
+    // A link, which another user could plant in /tmp, marks no adapter.
+    unlink("/tmp/bluetooth.info_hci0");
+    ASSERT_EQ(symlink("/etc/hostname", "/tmp/bluetooth.info_hci0"), 0);
+    LogCapture log;
+    EXPECT_EQ(Bluetooth::restartBluetoothd(), -1);
+    EXPECT_EQ(log.from("commandlib.cpp"), Lines{ "No dongle. Stop restarting bluetoothd..." });
 }
 
 }  // namespace

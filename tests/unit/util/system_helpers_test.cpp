@@ -64,17 +64,23 @@ TEST(AFifo, CarriesBytesOneWayAndReportsWhatGoesWrong) {
     EXPECT_EQ(log.from("fifo.cpp"), Lines(2, "Error writing the data to the pipe file."));
     writer.reset();
 
-    // No place for a pipe fails; a regular file is opened as it is.
+    // No place for a pipe fails, and a link is not followed; a regular file is
+    // opened as it is, and no program started later inherits it.
     log.clear();
+    std::string link = path + "-link";
+    ASSERT_EQ(symlink(path.c_str(), link.c_str()), 0);
+    EXPECT_EQ(Fifo::getReadFifo(link.c_str()), nullptr);
     EXPECT_EQ(Fifo::getReadFifo((path + "/below").c_str()), nullptr);
     EXPECT_EQ(Fifo::getWriteFifo(nullptr), nullptr);
-    EXPECT_EQ(log.from("fifo.cpp"), (Lines{ "Error opening the named file.", "Error opening the named file (null), errno is 22.",
+    EXPECT_EQ(log.from("fifo.cpp"), (Lines{ "Error opening the named file.", "Error opening the named file.",
+                                         "Error opening the named file (null), errno is 22.",
                                          "Error opening the named file." }));
     std::string plain = btbus_test::scratchDir() + "/plain";
     std::ofstream(plain) << "";
     std::unique_ptr<Fifo> file(Fifo::getReadFifo(plain.c_str()));
     ASSERT_NE(file, nullptr);
     EXPECT_EQ(file->readData(bytes, sizeof bytes), 0);  // end of file
+    EXPECT_EQ(system(("exec 2>/dev/null; ls -l /proc/self/fd | grep -q " + plain).c_str()), 256);
 }
 
 TEST(APidFile, LocksOutASecondProcessAndKeepsItsId) {
@@ -114,9 +120,14 @@ TEST(APidFile, LocksOutASecondProcessAndKeepsItsId) {
         EXPECT_EQ(WEXITSTATUS(status), (flags & 1) ? 1 : 0) << "flags " << flags;
         close(fd);
     }
+    // Neither a directory nor a link, which could send the id anywhere.
+    std::string link = path + "-link";
+    ASSERT_EQ(symlink(path.c_str(), link.c_str()), 0);
     LogCapture log;
-    EXPECT_EQ(createPidFile(btbus_test::scratchDir().c_str(), 0, true), -1);  // a directory
-    EXPECT_EQ(log.from("auto_connect.cpp"), Lines{ "Could not open PID file " + btbus_test::scratchDir() });
+    EXPECT_EQ(createPidFile(btbus_test::scratchDir().c_str(), 0, true), -1);
+    EXPECT_EQ(createPidFile(link.c_str(), 0, true), -1);
+    EXPECT_EQ(log.from("auto_connect.cpp"),
+              (Lines{ "Could not open PID file " + btbus_test::scratchDir(), "Could not open PID file " + link }));
 }
 
 TEST(TheHciHelpers, TakeAddressesFromPathsAndFailCleanlyWithoutARadio) {
