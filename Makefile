@@ -2,7 +2,7 @@
 BUILD ?= build
 JOBS ?= $(shell nproc)
 
-.PHONY: all deps configure build check check-ppc demo bench sanitize tsan clean
+.PHONY: all deps configure build check check-ppc demo bench sanitize tsan fuzz clean
 
 all: build
 
@@ -58,5 +58,20 @@ tsan: deps
 	cd $(BUILD)-tsan && TSAN_OPTIONS="suppressions=$(CURDIR)/tests/tsan.supp halt_on_error=1 second_deadlock_stack=1" \
 	  ctest --output-on-failure -j 2 -R "btbus_(core|bluez|scanner)_tests"
 
+# Each fuzz target under libFuzzer (clang, with AddressSanitizer and UBSan) for
+# FUZZ_SECONDS, from the committed seeds; what it finds new stays in
+# $(BUILD)-fuzz/corpus, a failing input in $(BUILD)-fuzz/crash-*.
+FUZZ_SECONDS ?= 60
+FUZZ_TARGETS = reply signal agent text_form auto_connect device_found
+fuzz: deps
+	cmake -S . -B $(BUILD)-fuzz -DCMAKE_BUILD_TYPE=RelWithDebInfo -DCMAKE_C_COMPILER=clang \
+	  -DCMAKE_CXX_COMPILER=clang++ -DBTBUS_FUZZ=ON -DBTBUS_BUILD_BENCHMARKS=OFF
+	cmake --build $(BUILD)-fuzz -j $(JOBS)
+	cd $(BUILD)-fuzz && for target in $(FUZZ_TARGETS); do \
+	  mkdir -p corpus/$$target && \
+	  ./tests/fuzz/btbus_fuzz_$$target -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
+	    -artifact_prefix=crash-$$target- corpus/$$target $(CURDIR)/tests/fuzz/corpus/$$target || exit 1; \
+	done
+
 clean:
-	rm -rf $(BUILD) $(BUILD)-sanitize $(BUILD)-tsan $(PPC_BUILD)
+	rm -rf $(BUILD) $(BUILD)-sanitize $(BUILD)-tsan $(BUILD)-fuzz $(PPC_BUILD)

@@ -17,13 +17,45 @@
 #include <bluetooth/manager.h>
 #include <bluetooth/util.h>
 
+#include "autoconnect/config_text.h"
 #include "core/log.h"
 
 BT_LOG_FILE("auto_connect.cpp");
 
 namespace Bluetooth {
 
+namespace internal {
+
+bool leadingNumber(const std::string& content, long& value) {
+    const char* start = content.c_str();
+    char* end = 0;
+    value = strtol(start, &end, 10);
+    return end != start;
+}
+
+bool enabledFlag(const std::string& content) {
+    long value = 0;
+    return leadingNumber(content, value) && value == 1;
+}
+
+std::vector<std::string> storedAddresses(const std::string& content) {
+    std::vector<std::string> addresses;
+    for (std::string::size_type at = 2; at < content.size();) {
+        std::string::size_type comma = content.find(',', at);
+        if (comma == std::string::npos) comma = content.size();
+        addresses.push_back(content.substr(at, comma - at));
+        at = comma + 1;
+    }
+    return addresses;
+}
+
+}  // namespace internal
+
 namespace {
+
+using internal::enabledFlag;
+using internal::leadingNumber;
+using internal::storedAddresses;
 
 const char kConfigDirectory[] = "/etc/bluetooth/autoconnect/";
 const char kCommandPipe[] = "/tmp/quill_bluetooth_autoconnect";
@@ -124,35 +156,6 @@ WriteResult writeAtomically(const std::string& path, const std::string& content,
     }
     if (!ok) unlink(temporary.c_str());
     return ok ? kWritten : kCannotWrite;
-}
-
-// A leading decimal integer (white space before it skipped); false when the
-// content does not begin with one.
-bool leadingNumber(const std::string& content, long& value) {
-    const char* start = content.c_str();
-    char* end = 0;
-    value = strtol(start, &end, 10);
-    return end != start;
-}
-
-// The flag read as a boolean, as a stream reads one: 1 is true; 0, any other
-// number and no number are false.
-bool enabledFlag(const std::string& content) {
-    long value = 0;
-    return leadingNumber(content, value) && value == 1;
-}
-
-// The list's pieces: from the third character (past the flag and its comma),
-// each up to the next "," or the end.
-std::vector<std::string> storedAddresses(const std::string& content) {
-    std::vector<std::string> addresses;
-    for (std::string::size_type at = 2; at < content.size();) {
-        std::string::size_type comma = content.find(',', at);
-        if (comma == std::string::npos) comma = content.size();
-        addresses.push_back(content.substr(at, comma - at));
-        at = comma + 1;
-    }
-    return addresses;
 }
 
 // Appends the devices that adapter knows to devices; the other addresses go to
