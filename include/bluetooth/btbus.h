@@ -21,5 +21,6 @@
 #include <bluetooth/server_object.h>
 #include <bluetooth/util.h>
 #include <bluetooth/variant.h>
+#include <bluetooth/version.h>
 
 #endif

@@ -42,7 +42,7 @@ void fail(GError** error, const char* format, const char* argument) {
 // lets it go before any bus call. Bus calls use a Manager of the caller's own:
 // the server's Manager is the receiving thread's dispatching object, whose
 // error state that thread writes.
-struct ScannerServer::Service {
+struct __attribute__((visibility("hidden"))) ScannerServer::Service {
     typedef std::lock_guard<std::mutex> Hold;
 
     static ScannerServer* current() { return gServer.load(); }

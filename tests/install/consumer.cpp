@@ -1,6 +1,7 @@
 // A program of a library user: built as C++11 against the installed headers.
 #include <cstdlib>
 #include <iostream>
+#include <string>
 
 #include <bluetooth/btbus.h>
 
@@ -22,6 +23,11 @@ int main() {
     // The scanner's client asks BlueZ first, which is not there either.
     Bluetooth::Scanner scanner;
     ok = ok && scanner.listDevices("hci0", false) == 0 && !scanner.removeFinder("hci0");
+    // Built against the headers of the release it runs with.
+#if !BTBUS_VERSION_AT_LEAST(0, 2, 0)
+#error "btbus.h gives no version"
+#endif
+    ok = ok && std::string(Bluetooth::version()) == BTBUS_VERSION;
     std::cout << (ok ? "consumer ok" : "consumer FAILED") << std::endl;
     return ok ? 0 : 1;
 }

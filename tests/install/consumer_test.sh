@@ -55,8 +55,12 @@ test -n "$pc" || { echo "btbus.pc was not installed"; exit 1; }
 PKG_CONFIG_PATH=$(dirname "$pc")
 export PKG_CONFIG_PATH
 libdir=$(pkg-config --variable=libdir btbus)
+# While the version is 0.x the soname carries the minor version as well.
+version=$(pkg-config --modversion btbus)
+expected=libbtbus.so.$(echo "$version" | cut -d. -f1)
+case $version in 0.*) expected=libbtbus.so.$(echo "$version" | cut -d. -f1-2) ;; esac
 soname=$(readelf -d "$libdir/libbtbus.so" | sed -n 's/.*SONAME.*\[\(.*\)\]/\1/p')
-test "$soname" = libbtbus.so.0 || { echo "unexpected SONAME '$soname'"; exit 1; }
+test "$soname" = "$expected" || { echo "SONAME '$soname', not $expected"; exit 1; }
 
 # shellcheck disable=SC2046
 "$cxx" -std=c++11 -Wall -Wextra -Werror ${CXXFLAGS:-} -o "$prefix/consumer" "$here/consumer.cpp" $(pkg-config --cflags --libs btbus)
