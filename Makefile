@@ -2,7 +2,7 @@
 BUILD ?= build
 JOBS ?= $(shell nproc)
 
-.PHONY: all deps configure build check check-ppc demo bench sanitize tsan fuzz clean
+.PHONY: all deps configure build check check-ppc demo bench sanitize tsan fuzz docs clean
 
 all: build
 
@@ -32,6 +32,10 @@ check-ppc:
 	  "-DBTBUS_EMULATOR=qemu-ppc;-L;/usr/powerpc-linux-gnu;-E;LD_LIBRARY_PATH=$$sysroot/usr/lib"
 	cmake --build $(PPC_BUILD) -j $(JOBS)
 	cd $(PPC_BUILD) && ctest --output-on-failure -j 2
+
+# The API reference, from the headers and docs/, in $(BUILD)/docs/html.
+docs: configure
+	cmake --build $(BUILD) --target docs
 
 # Runs the main job against the BlueZ 4 simulator on private buses.
 demo: build

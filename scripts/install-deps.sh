@@ -8,7 +8,8 @@ set -eu
 PACKAGES="cmake make g++ pkg-config
 libdbus-1-dev dbus-daemon dbus-bin libdbus-glib-1-dev libdbus-glib-1-dev-bin libglib2.0-dev libbluetooth-dev libboost-dev
 libgtest-dev libbenchmark-dev libcli11-dev nlohmann-json3-dev
-python3-dbus python3-gi python3-dbusmock libglib2.0-bin util-linux systemd"
+python3-dbus python3-gi python3-dbusmock libglib2.0-bin util-linux systemd
+doxygen graphviz dpkg-dev debhelper lintian"
 if [ "${1:-}" = ppc ]; then
     PACKAGES="$PACKAGES g++-powerpc-linux-gnu qemu-user meson ninja-build autoconf automake libtool
 googletest bzip2 xz-utils dpkg-dev"

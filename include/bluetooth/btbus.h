@@ -1,7 +1,7 @@
 #ifndef BTBUS_BLUETOOTH_BTBUS_H
 #define BTBUS_BLUETOOTH_BTBUS_H
 
-// Every public header of btbus.
+/// Every public header of btbus.
 #include <bluetooth/adapter.h>
 #include <bluetooth/agent.h>
 #include <bluetooth/audio.h>

@@ -5,15 +5,15 @@
 
 namespace Bluetooth {
 
-// Access to libdbus's shared bus connections: one per bus and process.
+/// Access to libdbus's shared bus connections: one per bus and process.
 class Connection {
 public:
-    // Takes one more reference on the shared connection for the bus type.
-    // Logs "Failed to get bus connection" and returns null when the bus cannot
-    // be reached. Nothing is cached here: every call asks libdbus again.
+    /// Takes one more reference on the shared connection for the bus type.
+    /// Logs "Failed to get bus connection" and returns null when the bus cannot
+    /// be reached. Nothing is cached here: every call asks libdbus again.
     static DBusConnection* get(DBusBusType type);
 
-    // Drops one reference taken by get(); null is ignored.
+    /// Drops one reference taken by get(); null is ignored.
     static void unref(DBusConnection* connection);
 };
 
