@@ -27,46 +27,6 @@ services=$prefix/share/dbus-1/services
 grep -qx "Exec=$prefix/bin/btbus-scanner" "$services/com.quillmar.bluetooth.service" ||
     { echo "the scanner's session service file does not name the installed daemon"; exit 1; }
 
-# The installed simulator on private buses whose session bus starts the
-# installed btbus-scanner for btbusctl's scan through the scanner service.
-"$prefix/bin/bluez4-sim" --service-dir "$services" >"$prefix/sim.env" &
-sim=$!
-trap 'kill $sim 2>/dev/null; wait $sim 2>/dev/null || true' EXIT
-tries=0
-until [ "$(wc -l <"$prefix/sim.env")" -ge 2 ]; do
-    tries=$((tries + 1))
-    [ $tries -lt 200 ] && kill -0 $sim 2>/dev/null || { echo "the installed bluez4-sim did not come up"; exit 1; }
-    sleep 0.05
-done
-found=$(. "$prefix/sim.env" && "$prefix/bin/btbusctl" --json scan --shared --timeout 3)
-echo "$found" | grep -q '"address":"00:0D:3C:A1:B2:C3"' ||
-    { echo "the installed btbus-scanner listed no headset: $found"; exit 1; }
-kill $sim
-wait $sim || true
-trap - EXIT
-if pgrep -f "$prefix/bin/btbus-scanner" >/dev/null; then
-    echo "the activated btbus-scanner outlived its session bus"
-    pkill -f "$prefix/bin/btbus-scanner"
-    exit 1
-fi
-
-pc=$(find "$prefix" -name btbus.pc)
-test -n "$pc" || { echo "btbus.pc was not installed"; exit 1; }
-PKG_CONFIG_PATH=$(dirname "$pc")
-export PKG_CONFIG_PATH
-libdir=$(pkg-config --variable=libdir btbus)
-# While the version is 0.x the soname carries the minor version as well.
-version=$(pkg-config --modversion btbus)
-expected=libbtbus.so.$(echo "$version" | cut -d. -f1)
-case $version in 0.*) expected=libbtbus.so.$(echo "$version" | cut -d. -f1-2) ;; esac
-soname=$(readelf -d "$libdir/libbtbus.so" | sed -n 's/.*SONAME.*\[\(.*\)\]/\1/p')
-test "$soname" = "$expected" || { echo "SONAME '$soname', not $expected"; exit 1; }
-
-# shellcheck disable=SC2046
-"$cxx" -std=c++11 -Wall -Wextra -Werror ${CXXFLAGS:-} -o "$prefix/consumer" "$here/consumer.cpp" $(pkg-config --cflags --libs btbus)
-LD_LIBRARY_PATH=$libdir "$prefix/consumer"
-
-cmake -S "$here/cmake_consumer" -B "$prefix/cmake-consumer" -DCMAKE_PREFIX_PATH="$prefix" \
-      -DCMAKE_CXX_COMPILER="$cxx" >/dev/null
-cmake --build "$prefix/cmake-consumer" >/dev/null
-LD_LIBRARY_PATH=$libdir "$prefix/cmake-consumer/consumer"
+. "$here/installed.sh"
+scan_through_installed_scanner "$prefix" "$services"
+build_consumers "$prefix" "$here" "$cxx"
