@@ -16,10 +16,19 @@ class PairingTest(SimTestCase):
 
     def setUp(self):
         super().setUp()
-        self.control('AddDevice', 'hci0', json.dumps(PIN_DEVICE))
-        self.control('AddDevice', 'hci0', json.dumps(SSP_DEVICE))
         self.agent = TestAgent(self.bus, '/test/agent')
         self.addCleanup(self.agent.remove_from_connection)
+        self.scene()
+
+    def scene(self):
+        """The starting scene, the two devices added, nothing recorded."""
+        self.control('Reset')
+        self.control('AddDevice', 'hci0', json.dumps(PIN_DEVICE))
+        self.control('AddDevice', 'hci0', json.dumps(SSP_DEVICE))
+        self.control('ClearCallLog')
+        self.drain()
+        del self.signals[:]
+        del self.agent.calls[:]
 
     def pair(self, device, capability, timeout=10):
         return AsyncCall(self.bus, self.adapter, ADAPTER, 'CreatePairedDevice', 'sos',
@@ -32,40 +41,34 @@ class PairingTest(SimTestCase):
         self.assertTrue(props['Paired'])
         self.assertEqual(self.agent.members()[-1], 'Release')
 
-    def test_pin_code(self):
-        self.agent.answers['RequestPinCode'] = PIN_DEVICE['pin']
-        call = self.pair(PIN_DEVICE, 'DisplayYesNo')
-        self.assert_paired(call, PIN_DEVICE)
-        self.assertEqual(self.agent.calls[0], ('RequestPinCode', call.result))
-        self.drain()
-        members = [s[2] for s in self.signals]
-        self.assertEqual(members[:3], ['DeviceCreated', 'PropertyChanged', 'PropertyChanged'])
-        self.assertEqual(self.signals[2][3], ['Connected', True])
-        self.assertIn(['Paired', True], [s[3] for s in self.signals])
-
-    def test_wrong_pin_fails_and_removes_the_device(self):
-        self.agent.answers['RequestPinCode'] = PIN_DEVICE['pin'] + '9'
-        call = self.pair(PIN_DEVICE, 'DisplayYesNo')
-        self.assertEqual(call.error.get_dbus_name(), 'org.bluez.Error.AuthenticationFailed')
-        self.wait_signal('DeviceRemoved')
-
-    def test_passkey(self):
-        self.agent.answers['RequestPasskey'] = dbus.UInt32(SSP_DEVICE['passkey'])
-        call = self.pair(SSP_DEVICE, 'KeyboardOnly')
-        self.assert_paired(call, SSP_DEVICE)
-        self.assertEqual(self.agent.members(), ['RequestPasskey', 'Release'])
-
-    def test_confirmation_shows_the_device_passkey(self):
-        call = self.pair(SSP_DEVICE, 'DisplayYesNo')
-        self.assert_paired(call, SSP_DEVICE)
-        self.assertEqual(self.agent.calls[0], ('RequestConfirmation', call.result, SSP_DEVICE['passkey']))
-
-    def test_rejection_is_an_error(self):
-        self.agent.answers['RequestConfirmation'] = rejected()
-        call = self.pair(SSP_DEVICE, 'DisplayYesNo')
-        self.assertEqual(call.error.get_dbus_name(), 'org.bluez.Error.AuthenticationFailed')
-        self.assertTrue(self.run_until_agent('Release'))
-        self.assertEqual(self.agent.members(), ['RequestConfirmation', 'Release'])
+    def test_each_kind_of_request_and_its_outcome(self):
+        """(device, capability, the agent's answer, error or None, the agent's calls after the first)"""
+        passkey = dbus.UInt32(SSP_DEVICE['passkey'])
+        rows = [(PIN_DEVICE, 'DisplayYesNo', ('RequestPinCode', PIN_DEVICE['pin']), None, ['Release']),
+                (PIN_DEVICE, '', ('RequestPinCode', PIN_DEVICE['pin'] + '9'), 'AuthenticationFailed', []),
+                (SSP_DEVICE, 'KeyboardOnly', ('RequestPasskey', passkey), None, ['Release']),
+                (SSP_DEVICE, 'DisplayYesNo', ('RequestConfirmation', ''), None, ['Release']),
+                (SSP_DEVICE, 'DisplayYesNo', ('RequestConfirmation', rejected()), 'AuthenticationFailed', ['Release'])]
+        for device, capability, (request, answer), error, after in rows:
+            with self.subTest(request=request, capability=capability, error=error):
+                self.scene()
+                self.agent.answers = {request: answer}
+                call = self.pair(device, capability)
+                dev = self.device_path(device['address'])
+                self.assertEqual(self.agent.calls[0], (request, dev, *([SSP_DEVICE['passkey']] if request ==
+                                                                         'RequestConfirmation' else [])))
+                log = f'agent {self.bus.get_unique_name()} /test/agent org.bluez.Agent.{request}({dev}'
+                self.assertIn(log, list(self.control('GetCallLog'))[1])
+                if error:
+                    self.assertEqual(call.error.get_dbus_name(), 'org.bluez.Error.' + error)
+                else:
+                    self.assert_paired(call, device)
+                self.assertTrue(run_until(lambda: self.agent.members()[1:] == after, 5))
+                self.drain()
+                members = [m for _p, _i, m, _a in self.signals]
+                self.assertEqual(members[0], 'DeviceCreated')
+                self.assertEqual('DeviceRemoved' in members, error is not None)  # a failed pairing drops it
+                self.assertEqual(['Paired', True] in [a for _p, _i, _m, a in self.signals], error is None)
 
     def test_cancel_device_creation(self):
         self.agent.answers['RequestPasskey'] = None  # the agent keeps the user thinking
@@ -85,13 +88,6 @@ class PairingTest(SimTestCase):
             f'{self.adapter} org.bluez.Adapter.CancelDeviceCreation({SSP_DEVICE["address"]})',
             f'agent {me} /test/agent org.bluez.Agent.Cancel() -> sent',
             f'agent {me} /test/agent org.bluez.Agent.Release() -> sent'])
-
-    def test_call_log_shows_agent_answers(self):
-        self.agent.answers['RequestPinCode'] = PIN_DEVICE['pin']
-        call = self.pair(PIN_DEVICE, '')
-        log = list(self.control('GetCallLog'))
-        me = self.bus.get_unique_name()
-        self.assertEqual(log[1], f'agent {me} /test/agent org.bluez.Agent.RequestPinCode({call.result}) -> 8345')
 
     def test_errors(self):
         self.assert_error('org.bluez.Error.InvalidArguments', self.adapter, ADAPTER, 'CreatePairedDevice',
