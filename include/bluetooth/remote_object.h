@@ -246,10 +246,13 @@ private:
     RemoteObject(const RemoteObject&) = delete;
     RemoteObject& operator=(const RemoteObject&) = delete;
 
+    // Instantiated inside the library only, for its five lists: not exported.
     template <typename F>
-    int addSignalHandler(std::list<SignalHandler<F> >& list, const char* signalName, F function);
+    __attribute__((visibility("hidden"))) int addSignalHandler(std::list<SignalHandler<F> >& list,
+                                                               const char* signalName, F function);
     template <typename F>
-    void removeSignalHandlers(std::list<SignalHandler<F> >& list, std::vector<std::string>& rules);
+    __attribute__((visibility("hidden"))) void removeSignalHandlers(std::list<SignalHandler<F> >& list,
+                                                                    std::vector<std::string>& rules);
     /// A signal that cannot be decoded: logs what (at line of the dispatcher) and
     /// records number on the dispatching object, if any, unless an operation runs
     /// on it. Returns false, the dispatchers' "not handled".
