@@ -70,25 +70,6 @@ class PairingTest(SimTestCase):
                 self.assertEqual('DeviceRemoved' in members, error is not None)  # a failed pairing drops it
                 self.assertEqual(['Paired', True] in [a for _p, _i, _m, a in self.signals], error is None)
 
-    def test_cancel_device_creation(self):
-        self.agent.answers['RequestPasskey'] = None  # the agent keeps the user thinking
-        call = AsyncCall(self.bus, self.adapter, ADAPTER, 'CreatePairedDevice', 'sos',
-                         [SSP_DEVICE['address'], self.agent.path, 'KeyboardOnly'])
-        self.assertTrue(self.run_until_agent('RequestPasskey'))
-        self.call(self.adapter, ADAPTER, 'CancelDeviceCreation', SSP_DEVICE['address'])
-        call.wait()
-        self.assertEqual(call.error.get_dbus_name(), 'org.bluez.Error.AuthenticationCanceled')
-        self.assertTrue(self.run_until_agent('Release'))
-        self.assertEqual(self.agent.members(), ['RequestPasskey', 'Cancel', 'Release'])
-        me = self.bus.get_unique_name()
-        dev = self.device_path(SSP_DEVICE['address'])
-        self.assertEqual(list(self.control('GetCallLog')), [
-            f'{self.adapter} org.bluez.Adapter.CreatePairedDevice({SSP_DEVICE["address"]}, /test/agent, KeyboardOnly)',
-            f'agent {me} /test/agent org.bluez.Agent.RequestPasskey({dev}) -> pending',
-            f'{self.adapter} org.bluez.Adapter.CancelDeviceCreation({SSP_DEVICE["address"]})',
-            f'agent {me} /test/agent org.bluez.Agent.Cancel() -> sent',
-            f'agent {me} /test/agent org.bluez.Agent.Release() -> sent'])
-
     def test_errors(self):
         self.assert_error('org.bluez.Error.InvalidArguments', self.adapter, ADAPTER, 'CreatePairedDevice',
                           '00:AA', dbus.ObjectPath('/a'), '')

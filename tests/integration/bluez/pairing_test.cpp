@@ -204,12 +204,12 @@ TEST_F(APairing, AgentAuthorisesIncomingConnectionsOnTheReceivingThread) {
 // with arguments of the given types: the reply's first argument as text ("" for
 // none), or the error's name.
 std::string callAsAPeer(const std::string& destination, const char* path, const char* member, int timeoutMs,
-                        const char* types = "") {
+                        const char* types = "", const char* interface = "org.bluez.Agent") {
     DBusConnection* connection = dbus_bus_get_private(DBUS_BUS_SYSTEM, nullptr);
     if (connection == nullptr) return "no connection";
     dbus_connection_set_exit_on_disconnect(connection, FALSE);
     Bluetooth::internal::MessagePtr message(
-        dbus_message_new_method_call(destination.c_str(), path, "org.bluez.Agent", member));
+        dbus_message_new_method_call(destination.c_str(), path, interface, member));
     const char* device = "/org/bluez/1/hci0/dev_00_11_22_33_44_55";
     const char* uuid = kA2dpSink;
     dbus_uint32_t passkey = 123456;
@@ -237,32 +237,44 @@ std::string callAsAPeer(const std::string& destination, const char* path, const 
 // Every kind of request a peer can make of the agent, whichever thread
 // dispatches the connection: the answer, and the line logged.
 void expectAnswersToPeers(const std::string& me, const Agent& agent) {
+    const char* const unhandled = "agent.cpp:410 Registered agent does not provide a handler for the incoming message.";
+    const char* const unknown = "org.freedesktop.DBus.Error.UnknownMethod";
     const struct {
         const char* member;
         const char* types;
         const char* answer;
         const char* log;
+        const char* interface;
     } rows[] = {
-        { "RequestPinCode", "o", "482913", "" },
-        { "RequestPasskey", "o", "482913", "" },
-        { "RequestConfirmation", "ou", "", "" },
-        { "Authorize", "os", "", "" },
-        { "Cancel", "", "", "" },
-        { "Release", "", "", "" },
+        { "RequestPinCode", "o", "482913", "", "org.bluez.Agent" },
+        { "RequestPasskey", "o", "482913", "", "org.bluez.Agent" },
+        { "RequestConfirmation", "ou", "", "", "org.bluez.Agent" },
+        { "Authorize", "os", "", "", "org.bluez.Agent" },
+        { "Cancel", "", "", "", "org.bluez.Agent" },
+        { "Release", "", "", "", "org.bluez.Agent" },
         // Not the agent's answers: libdbus answers what no handler took.
-        { "DisplayPasskey", "ou", "org.freedesktop.DBus.Error.UnknownMethod",
-          "agent.cpp:410 Registered agent does not provide a handler for the incoming message." },
-        { "RequestPasskey", "", "org.freedesktop.DBus.Error.UnknownMethod",
-          "agent.cpp:200 Failed to get argument from request passkey message." },
-        // Bad arguments of a PIN request count as handled: no answer at all.
+        { "DisplayPasskey", "ou", unknown, unhandled, "org.bluez.Agent" },
+        { "ConfirmModeChange", "", unknown, unhandled, "org.bluez.Agent" },
+        { "DisplayPinCode", "", unknown, unhandled, "org.bluez.Agent" },
+        { "RequestPinCode", "o", unknown, unhandled, "org.bluez.Adapter" },
+        { "Release", "", unknown, unhandled, "org.example.Other" },
+        { "RequestPasskey", "", unknown, "agent.cpp:200 Failed to get argument from request passkey message.",
+          "org.bluez.Agent" },
+        { "RequestConfirmation", "", unknown,
+          "agent.cpp:252 Failed to get argument from request confirmation message.", "org.bluez.Agent" },
+        { "RequestConfirmation", "os", unknown,
+          "agent.cpp:252 Failed to get argument from request confirmation message.", "org.bluez.Agent" },
+        { "Authorize", "", unknown, "agent.cpp:293 Failed to get argument from authorize message.",
+          "org.bluez.Agent" },
+        // deliberate asymmetry: bad arguments of a PIN request count as handled, with no answer at all.
         { "RequestPinCode", "", "org.freedesktop.DBus.Error.NoReply",
-          "agent.cpp:167 Failed to get argument from request pin code message." },
+          "agent.cpp:167 Failed to get argument from request pin code message.", "org.bluez.Agent" },
     };
     for (const auto& row : rows) {
-        SCOPED_TRACE(std::string(row.member) + "(" + row.types + ")");
+        SCOPED_TRACE(std::string(row.interface) + "." + row.member + "(" + row.types + ")");
         LogCapture log;
         auto start = std::chrono::steady_clock::now();
-        EXPECT_EQ(callAsAPeer(me, agent.getPath(), row.member, 1000, row.types), row.answer);
+        EXPECT_EQ(callAsAPeer(me, agent.getPath(), row.member, 1000, row.types, row.interface), row.answer);
         if (*row.log == '\0') EXPECT_LT(std::chrono::steady_clock::now() - start, btbus_test::scaled(500ms));
         EXPECT_EQ(log.lines(), *row.log ? std::vector<std::string>{ row.log } : std::vector<std::string>{});
     }
@@ -359,8 +371,8 @@ TEST_F(APairing, WithoutAReceivingThreadIsAnsweredByTheThreadThatDispatches) {
     loop.join();
     {
         std::lock_guard<std::mutex> lock(gLock);
-        EXPECT_EQ(gThreads.size(), 10u);
-        EXPECT_EQ(std::count(gThreads.begin(), gThreads.end(), loopThread), 10);
+        EXPECT_EQ(gThreads.size(), 17u);
+        EXPECT_EQ(std::count(gThreads.begin(), gThreads.end(), loopThread), 17);
     }
     // The same through a GLib main loop that the connection is attached to.
     dbus_connection_setup_with_g_main(system, nullptr);
