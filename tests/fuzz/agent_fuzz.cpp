@@ -6,21 +6,14 @@
 using namespace Bluetooth;
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
-    static bool ready = fuzz::offline();
     static Agent agent;
-    (void)ready;
-    DBusMessage* message = fuzz::demarshal(data, size);
-    if (message == 0 || size == 0) {
-        if (message != 0) dbus_message_unref(message);
-        return 0;
-    }
-    // The settings vary with the input, as a caller may set them.
-    agent.setReject(data[size - 1] & 1);
-    agent.setPasskeyValue((data[size - 1] & 2) ? "482913" : "not a number");
-    DBusHandlerResult result = Agent::handlerDispatcher(0, message, &agent);
-    fuzz::require(result == DBUS_HANDLER_RESULT_HANDLED || result == DBUS_HANDLER_RESULT_NOT_YET_HANDLED ||
-                      result == DBUS_HANDLER_RESULT_NEED_MEMORY,
-                  "one of libdbus's three handler results");
-    dbus_message_unref(message);
-    return 0;
+    return fuzz::withMessage(data, size, [&](DBusMessage* message) {
+        // The settings vary with the input, as a caller may set them.
+        agent.setReject(data[size - 1] & 1);
+        agent.setPasskeyValue((data[size - 1] & 2) ? "482913" : "not a number");
+        DBusHandlerResult result = Agent::handlerDispatcher(0, message, &agent);
+        fuzz::require(result == DBUS_HANDLER_RESULT_HANDLED || result == DBUS_HANDLER_RESULT_NOT_YET_HANDLED ||
+                          result == DBUS_HANDLER_RESULT_NEED_MEMORY,
+                      "one of libdbus's three handler results");
+    });
 }

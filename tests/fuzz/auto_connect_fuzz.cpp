@@ -11,9 +11,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     std::string content(reinterpret_cast<const char*>(data), size);
     // The flag as a stream reads a number, from before any embedded zero byte.
     std::istringstream in(content.c_str());
-    long flag = 0;
+    long flag = 0, read = 0;
     bool number = static_cast<bool>(in >> flag) || (flag != 0 && in.fail());  // an overflow still read digits
-    long read = 0;
     fuzz::require(leadingNumber(content, read) == number, "a leading number exactly when a stream reads one");
     fuzz::require(enabledFlag(content) == (number && flag == 1), "enabled exactly when the flag is 1");
     // The pieces after the flag and its comma, joined again, are the rest.

@@ -3,8 +3,8 @@
 #ifndef BTBUS_TESTS_FUZZ_FUZZ_H
 #define BTBUS_TESTS_FUZZ_FUZZ_H
 
-#include <cstddef>
 #include <cstdint>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <string>
@@ -15,48 +15,43 @@
 
 namespace fuzz {
 
-inline void quiet(const char*) {}
-
-// Once, before any object: buses that cannot be reached (a connection fails
-// at once, and never reaches the host's), and log lines that go nowhere.
+// Before main, so before any object: buses that cannot be reached (a connection
+// fails at once, never reaching the host's), and log lines that go nowhere.
 inline bool offline() {
     setenv("DBUS_SYSTEM_BUS_ADDRESS", "unix:path=/nonexistent/btbus-fuzz", 1);
     setenv("DBUS_SESSION_BUS_ADDRESS", "unix:path=/nonexistent/btbus-fuzz", 1);
-    Bluetooth::internal::setLogSink(&quiet);
+    Bluetooth::internal::setLogSink([](const char*) {});
     return true;
 }
+static const bool kOffline = offline();
 
-// A 32-bit word of a message in its own byte order ('l' or 'B' at its start).
-inline uint32_t word(const std::string& bytes, size_t at) {
-    uint32_t value;
-    memcpy(&value, &bytes[at], 4);
-    bool little = bytes[0] == 'l';
-    return little == (__BYTE_ORDER__ == __ORDER_LITTLE_ENDIAN__) ? value : __builtin_bswap32(value);
-}
-
-inline void setWord(std::string& bytes, size_t at, uint32_t value) {
-    if ((bytes[0] == 'l') != (__BYTE_ORDER__ == __ORDER_LITTLE_ENDIAN__)) value = __builtin_bswap32(value);
-    memcpy(&bytes[at], &value, 4);
-}
-
-// The message that data holds, or null; the caller unrefs it. The body's
-// length is taken from the input's size, so that a mutation elsewhere still
-// reaches libdbus's checks of the content and the decoders behind them.
-inline DBusMessage* demarshal(const uint8_t* data, size_t size) {
+// Gives use the message that data holds, if any. The body's length is taken from the
+// input's size: a mutation elsewhere still reaches libdbus's checks and the decoders.
+template <typename Use>
+int withMessage(const uint8_t* data, size_t size, Use use) {
     if (size < 16 || size > (1u << 20) || (data[0] != 'l' && data[0] != 'B')) return 0;
     std::string bytes(reinterpret_cast<const char*>(data), size);
-    size_t headerEnd = 16 + ((static_cast<size_t>(word(bytes, 12)) + 7) & ~static_cast<size_t>(7));
+    // Its 32-bit words are in its own byte order, the one 'l' or 'B' names.
+    bool swapped = (data[0] == 'l') != (__BYTE_ORDER__ == __ORDER_LITTLE_ENDIAN__);
+    uint32_t word;
+    memcpy(&word, &bytes[12], 4);
+    size_t headerEnd = 16 + ((static_cast<size_t>(swapped ? __builtin_bswap32(word) : word) + 7) & ~size_t(7));
     if (headerEnd > size) return 0;
-    setWord(bytes, 4, static_cast<uint32_t>(size - headerEnd));
-    return dbus_message_demarshal(bytes.data(), static_cast<int>(size), 0);
+    word = static_cast<uint32_t>(size - headerEnd);
+    if (swapped) word = __builtin_bswap32(word);
+    memcpy(&bytes[4], &word, 4);
+    DBusMessage* message = dbus_message_demarshal(bytes.data(), static_cast<int>(size), 0);
+    if (message == 0) return 0;
+    use(message);
+    dbus_message_unref(message);
+    return 0;
 }
 
 // A failed check: the fuzzer reports the input that made it.
 inline void require(bool holds, const char* what) {
-    if (!holds) {
-        fprintf(stderr, "check failed: %s\n", what);
-        abort();
-    }
+    if (holds) return;
+    fprintf(stderr, "check failed: %s\n", what);
+    abort();
 }
 
 }  // namespace fuzz

@@ -5,7 +5,6 @@
 #include <fstream>
 #include <iterator>
 #include <string>
-#include <vector>
 
 extern "C" int LLVMFuzzerTestOneInput(const unsigned char* data, size_t size);
 
@@ -14,7 +13,7 @@ int main(int argc, char** argv) {
     for (int i = 1; i < argc; ++i)
         for (const auto& file : std::filesystem::directory_iterator(argv[i])) {
             std::ifstream in(file.path(), std::ios::binary);
-            std::vector<char> bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+            std::string bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
             LLVMFuzzerTestOneInput(reinterpret_cast<const unsigned char*>(bytes.data()), bytes.size());
             ++inputs;
         }

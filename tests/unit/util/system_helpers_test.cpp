@@ -32,10 +32,9 @@ std::string contentOf(const std::string& path) {
 
 TEST(AFifo, CarriesBytesOneWayAndReportsWhatGoesWrong) {
     std::string path = btbus_test::scratchDir() + "/fifo";
-    LogCapture log;
-    // No reader: only the first message, and the pipe is created meanwhile.
+    // No reader (its log line is checked with the auto-connect commands), but
+    // the pipe is created meanwhile.
     EXPECT_EQ(Fifo::getWriteFifo(path.c_str()), nullptr);
-    EXPECT_EQ(log.from("fifo.cpp"), Lines{ "Error opening the named file " + path + ", errno is 6." });
     struct stat info;
     ASSERT_EQ(stat(path.c_str(), &info), 0);
     EXPECT_TRUE(S_ISFIFO(info.st_mode));
@@ -43,18 +42,15 @@ TEST(AFifo, CarriesBytesOneWayAndReportsWhatGoesWrong) {
     int reader = open(path.c_str(), O_RDONLY | O_NONBLOCK);
     std::unique_ptr<Fifo> writer(Fifo::getWriteFifo(path.c_str()));
     ASSERT_NE(writer, nullptr);
-    EXPECT_EQ(writer->writeData("pause", 5), 0);
     EXPECT_EQ(writer->writeData("", 0), 0);
     EXPECT_EQ(writer->writeData(nullptr, 1), -1);
     char bytes[16] = {};
-    EXPECT_EQ(read(reader, bytes, sizeof bytes), 5);
-    EXPECT_STREQ(bytes, "pause");
     std::unique_ptr<Fifo> readBack(Fifo::getReadFifo(path.c_str()));  // a writer is there: no wait
     ASSERT_NE(readBack, nullptr);
     ASSERT_EQ(writer->writeData("1", 1), 0);
     EXPECT_EQ(readBack->readData(bytes, sizeof bytes), 0);
     EXPECT_EQ(bytes[0], '1');
-    log.clear();
+    LogCapture log;
     // A full pipe fails the write at once; so does a pipe whose readers have gone.
     std::string big(1 << 20, 'x');
     EXPECT_EQ(writer->writeData(big.data(), static_cast<int>(big.size())), -1);
@@ -86,30 +82,30 @@ TEST(AFifo, CarriesBytesOneWayAndReportsWhatGoesWrong) {
 TEST(APidFile, LocksOutASecondProcessAndKeepsItsId) {
     std::string path = btbus_test::scratchDir() + "/daemon.pid";
     std::ofstream(path) << "123456789012\n";  // left by a process that died
+    int held[2], release[2];
+    ASSERT_EQ(pipe(held), 0);
+    ASSERT_EQ(pipe(release), 0);
+    pid_t holder = fork();
+    if (holder == 0) {  // the first instance: holds the lock until told, or until the test ends
+        close(release[1]);
+        char byte = createPidFile(path.c_str(), 1, true) >= 0 ? 'y' : 'n';
+        (void)!write(held[1], &byte, 1);
+        (void)!read(release[0], &byte, 1);
+        _exit(0);
+    }
+    char byte = 0;
+    ASSERT_EQ(read(held[0], &byte, 1), 1);
+    ASSERT_EQ(byte, 'y');
     for (bool reportRunning : { true, false }) {
-        SCOPED_TRACE(reportRunning);
-        int held[2], release[2];
-        ASSERT_EQ(pipe(held), 0);
-        ASSERT_EQ(pipe(release), 0);
-        pid_t holder = fork();
-        if (holder == 0) {  // the first instance: holds the lock until told
-            close(release[1]);
-            char byte = createPidFile(path.c_str(), 1, true) >= 0 ? 'y' : 'n';
-            (void)!write(held[1], &byte, 1);
-            (void)!read(release[0], &byte, 1);
-            _exit(0);
-        }
-        char byte = 0;
-        ASSERT_EQ(read(held[0], &byte, 1), 1);
-        ASSERT_EQ(byte, 'y');
         LogCapture log;
         EXPECT_EQ(createPidFile(path.c_str(), 0, reportRunning), -1);
         EXPECT_EQ(contentOf(path), std::to_string(holder) + "\n");
-        EXPECT_EQ(log.from("auto_connect.cpp"), reportRunning ? Lines{ "PID file '" + path + "' is locked; Daemon is already running" } : Lines{});
-        close(release[1]);
-        waitpid(holder, nullptr, 0);
-        for (int fd : { held[0], held[1], release[0] }) close(fd);
+        EXPECT_EQ(log.from("auto_connect.cpp"),
+                  reportRunning ? Lines{ "PID file '" + path + "' is locked; Daemon is already running" } : Lines{});
     }
+    close(release[1]);
+    waitpid(holder, nullptr, 0);
+    for (int fd : { held[0], held[1], release[0] }) close(fd);
     // The holder has gone: taken over, and inherited across exec only without bit 0.
     for (int flags : { 0, 1, 2 }) {
         int fd = createPidFile(path.c_str(), flags, true);
