@@ -1,5 +1,5 @@
 // Proxy operations without a bus (the unit tests' bus addresses lead nowhere), or given a null: the
-// result and the one log line at the operation's own file and line, where no test over the bus shows it.
+// result and the one log line at the operation's own file and line.
 #include <functional>
 #include <memory>
 #include <string>
@@ -30,10 +30,12 @@ TEST(AProxyWithoutABus, FailsEveryOperationAndLogsItOnceAtItsOwnLine) {
     Audio audio(kDevicePath);
     AudioSink sink(kDevicePath);
     Control control(kDevicePath);
+    bool connected = true;  // a failed query leaves the answer as it was
     const struct {
         std::function<bool()> failed;
         std::string at, message;
     } cases[] = {
+        { [&] { return device.getProperties() == nullptr; }, "bluez_object.cpp:77", wait },
         { [&] { return device.setProperty(nullptr, Variant(true)) == -1; }, "bluez_object.cpp:107", null },
         { [&] { return manager.getAdapterByIndex(0) == nullptr; }, "manager.cpp:126", wait },
         { [&] { return manager.findAdapter(nullptr) == nullptr; }, "manager.cpp:156", null },
@@ -54,6 +56,8 @@ TEST(AProxyWithoutABus, FailsEveryOperationAndLogsItOnceAtItsOwnLine) {
         { [&] { return audio.disconnect() == -1; }, "audio.cpp:73", send },
         { [&] { return sink.connect() == -1; }, "audio_sink.cpp:58", send },
         { [&] { return sink.disconnect() == -1; }, "audio_sink.cpp:80", send },
+        { [&] { return sink.isConnected(connected) == -1 && connected; }, "audio_sink.cpp:106", wait },
+        { [&] { return control.isConnected(connected) == -1 && connected; }, "control.cpp:60", wait },
         { [&] { return control.volumeDown() == -1; }, "control.cpp:82", send },
         { [&] { return control.volumeUp() == -1; }, "control.cpp:105", send },
     };
