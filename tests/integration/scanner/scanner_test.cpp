@@ -32,7 +32,7 @@ const char kAddress[] = "00:11:22:33:44:55";
 bool scannerRuns() { return nameHasOwner(DBUS_BUS_SESSION, kName); }
 
 // The scanner's a{ss} answer in full (the empty key included) or its error.
-struct Answer { Texts devices; std::string error; };
+struct Answer { Texts devices; std::string errorName, error; };
 
 // A call to the scanner with one string argument, on a connection of its own
 // so that the library's shared one is not involved. Without wait the caller
@@ -40,7 +40,7 @@ struct Answer { Texts devices; std::string error; };
 Answer callScanner(const char* method, const std::string& argument, bool wait = true) {
     ScopedError error;
     DBusConnection* connection = dbus_bus_get_private(DBUS_BUS_SESSION, error.get());
-    if (connection == nullptr) return Answer{ {}, error.text() };
+    if (connection == nullptr) return Answer{ {}, error.name(), error.text() };
     dbus_connection_set_exit_on_disconnect(connection, FALSE);
     MessagePtr call(dbus_message_new_method_call(kName, "/", kInterface, method)), reply;
     const char* text = argument.c_str();
@@ -50,7 +50,7 @@ Answer callScanner(const char* method, const std::string& argument, bool wait = 
     dbus_connection_flush(connection);
     dbus_connection_close(connection);
     dbus_connection_unref(connection);
-    Answer answer{ {}, error.text() };
+    Answer answer{ {}, error.name(), error.text() };
     DBusMessageIter args, array, entry;
     if (reply && dbus_message_iter_init(reply.get(), &args) && dbus_message_iter_get_arg_type(&args) == DBUS_TYPE_ARRAY)
         for (dbus_message_iter_recurse(&args, &array); dbus_message_iter_get_arg_type(&array) != DBUS_TYPE_INVALID;
@@ -199,9 +199,10 @@ TEST_F(AScannerDaemon, ListsTheLatestTextsRemovesFindersAndAnswersErrorsWithTheC
             if (expected.empty()) EXPECT_EQ(output, "") << tools[tool][0] << c[0];
         }
     }
-    // gdbus took the argument's type from the introspection; the answer's is there too.
     std::string introspection = shell("gdbus introspect --session --dest com.quillmar.bluetooth --object-path /");
-    EXPECT_NE(introspection.find("out a{ss} arg1);"), std::string::npos) << introspection;
+    EXPECT_NE(introspection.find("ListDevices(in  s arg0,\n                  out a{ss} arg1);"), std::string::npos) << introspection;
+    EXPECT_NE(introspection.find("RemoveFinder(in  s arg0);"), std::string::npos) << introspection;
+    EXPECT_EQ(callScanner("RemoveFinder", "hci9").errorName, "org.freedesktop.DBus.GLib.ErrorError");
     const std::string adapter = hci1 + " org.bluez.Adapter.";
     EXPECT_EQ(sim::logLinesWith(adapter + "StartDiscovery()").size(), 2u);
     EXPECT_EQ(sim::logLinesWith(adapter + "StopDiscovery()").size(), 2u);
