@@ -155,7 +155,7 @@ TEST_F(TheReceivingThread, LogsAMalformedSignalOnceAndStillOffersItToTheOtherLis
         emit(c.member, c.signature, c.arguments);
         drain(*peer);
 
-        // Only the other list's handler and the sentinel's were called.
+        // Only the argument-less handler, given the object whose thread dispatches, and the sentinel ran.
         EXPECT_EQ(events(), (std::vector<std::string>{ "bare /org/btbus/LoopOwner", "string /org/btbus/TestPeer done" }));
         EXPECT_EQ(log.from("remote_object.cpp"), std::vector<std::string>{ c.logged });
         EXPECT_EQ(log.lines().size(), 1u);
