@@ -11,8 +11,9 @@ namespace Bluetooth {
 /// system bus at "/org/bluez/agent_<pid>". It answers with fixed, pre-set
 /// values: the passkey text, after an optional delay, or a refusal when the
 /// reject flag is set. Its handlers run on whichever thread dispatches the
-/// system-bus connection (the receiving thread, or the thread waiting in
-/// Adapter::createPairedDevice); set everything before registerPath.
+/// system-bus connection (a receiving thread, the thread waiting in
+/// Adapter::createPairedDevice, or the program's own loop); set everything
+/// before registerPath.
 class Agent {
 public:
     static const char* const PSZ_NO_INPUT_NO_OUTPUT;  ///< "NoInputNoOutput"
@@ -23,7 +24,8 @@ public:
     /// Passkey "7391", no delay, no rejection, capability "DisplayYesNo". The
     /// path is not registered yet.
     Agent();
-    /// Does not unregister the path: call unregisterPath first.
+    /// Call unregisterPath first; a path still registered for this agent is
+    /// unregistered here, and a request running on another thread is waited for.
     virtual ~Agent();
 
     /// Builds the path and registers it on the system bus; 0, or -1 (logged).
@@ -55,8 +57,9 @@ public:
     int setCapability(const char* capability);
     /// The capability given to bluetoothd; "DisplayYesNo" until set.
     const char* getCapability() const;
-    /// Replaces the function that receives the path's messages (takes effect at
-    /// the next registerPath); null is refused (-1).
+    /// Replaces the function that receives the path's messages; it takes effect
+    /// at the next registerPath, not for a path registered already. Null is
+    /// refused (-1).
     int setDispatcher(DBusObjectPathMessageFunction function);
 
     /// The answers to bluetoothd's calls; agent is the Agent the message is for.
@@ -74,7 +77,8 @@ public:
     static DBusHandlerResult release(DBusConnection* connection, DBusMessage* message,
                                      Agent* agent);
     ///@}
-    /// Exist but are not dispatched: those calls are left unanswered.
+    /// Exist but are not dispatched: the default message function leaves those
+    /// calls unhandled, and libdbus answers them with UnknownMethod.
     ///@{
     static DBusHandlerResult displayPasskey(DBusConnection* connection, DBusMessage* message,
                                             Agent* agent);

@@ -69,6 +69,14 @@ typedef void (*SignalFunctionStringDict)(RemoteObject* object, const char* name,
 ///   while every receiving thread is busy in a handler, a waiting thread reads and
 ///   dispatches itself. sendMessagePending also answers the Agent's requests
 ///   meanwhile, so pairing works from any thread.
+/// - A program may dispatch the connection with a loop of its own (a thread in
+///   dbus_connection_read_write_dispatch, or GLib's after
+///   dbus_connection_setup_with_g_main). Without a receiving thread, its loop
+///   then runs the Agent and keeps the signals for itself. Inside its dispatch
+///   (a filter, an object path, a dbus-glib callback) a blocking call waits as
+///   libdbus does, dispatching nothing, and sendMessagePending fails at once
+///   (error 11): create the library's objects before adding filters of the
+///   program's own, so that the library sees each dispatch begin.
 /// - A handler may make calls, register handlers, and create or destroy proxies,
 ///   its own included. Destroying a proxy removes its handlers and waits for a
 ///   handler of it that runs on another thread to return. Destroying the object a
@@ -190,9 +198,10 @@ public:
     /// Starts the receiving thread for this object's connection; returns what
     /// pthread_create returns. The thread dispatches the connection: signals go
     /// to the handler lists, method calls to the object paths registered on it
-    /// (an Agent), replies to the calls waiting for them. Starting a loop makes
-    /// the connection survive a lost bus instead of exiting the process, and
-    /// takes over the connection's dispatch-status notification.
+    /// (an Agent), replies to the calls waiting for them. From the first object
+    /// made for a connection, the connection survives a lost bus instead of
+    /// exiting the process, and the library takes over its dispatch-status
+    /// notification.
     int startLoop();
     /// Ends every receiving thread in the process at once (a thread in a handler
     /// ends when the handler returns); threads started afterwards end at once.

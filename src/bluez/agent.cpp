@@ -2,6 +2,8 @@
 
 #include <cstdlib>
 #include <cstring>
+#include <map>
+#include <mutex>
 #include <sstream>
 
 #include <unistd.h>
@@ -152,6 +154,35 @@ DBusHandlerResult answer(DBusConnection* connection, DBusMessage* message, Agent
     return kHandled;
 }
 
+// The message function each registered path was registered with: as libdbus
+// keeps a copy of the handler table, a later setDispatcher waits for the next
+// registration.
+std::mutex gRegisteredLock;
+std::map<const Agent*, DBusObjectPathMessageFunction> gRegistered;
+
+void setRegistered(const Agent* agent, DBusObjectPathMessageFunction function) {
+    std::lock_guard<std::mutex> hold(gRegisteredLock);
+    if (function != 0)
+        gRegistered[agent] = function;
+    else
+        gRegistered.erase(agent);
+}
+
+DBusHandlerResult deferRequest(DBusConnection* connection, DBusMessage* request, void* data) {
+    DBusObjectPathMessageFunction function = 0;
+    {
+        std::lock_guard<std::mutex> hold(gRegisteredLock);
+        std::map<const Agent*, DBusObjectPathMessageFunction>::iterator found =
+            gRegistered.find(static_cast<const Agent*>(data));
+        if (found != gRegistered.end()) function = found->second;
+    }
+    if (function == 0) return DBUS_HANDLER_RESULT_NOT_YET_HANDLED;
+    DBusHandlerResult result = internal::ConnectionLoop::of(connection)->defer(request, function, data);
+    // libdbus would dispatch the request again and again: an answer that could
+    // not be made is no shortage of memory that time may cure.
+    return result == kNeedMemory ? kHandled : result;
+}
+
 }  // namespace
 
 Agent::Agent()
@@ -176,6 +207,7 @@ Agent::~Agent() {
             dbus_connection_unregister_object_path(connection, path.c_str());
         Connection::unref(connection);
     }
+    setRegistered(this, 0);
     internal::ConnectionLoop::forgetMethodCalls(this);
     std::free(vtable);
 }
@@ -187,24 +219,16 @@ int Agent::registerPath() {
     bool registered = false;
     DBusConnection* connection = Connection::get(DBUS_BUS_SYSTEM);
     if (connection != 0) {
+        internal::ConnectionLoop::of(connection);  // its filter sees the program's own dispatch
         internal::ScopedError error;
         // The quiet form: an already registered path is reported here, not on stderr.
         // Requests reach the handler table through the connection's loop, which
         // runs them outside libdbus's dispatch, on a thread that may wait (the
         // delay) without holding up anyone's replies.
-        static const DBusObjectPathVTable kDeferred = {
-            0,
-            [](DBusConnection* on, DBusMessage* request, void* data) -> DBusHandlerResult {
-                Agent* agent = static_cast<Agent*>(data);
-                if (agent->vtable == 0 || agent->vtable->message_function == 0)
-                    return DBUS_HANDLER_RESULT_NOT_YET_HANDLED;
-                return internal::ConnectionLoop::of(on)->defer(request, agent->vtable->message_function,
-                                                               agent);
-            },
-            0, 0, 0, 0
-        };
+        static const DBusObjectPathVTable kDeferred = { 0, &deferRequest, 0, 0, 0, 0 };
         registered = vtable != 0 && dbus_connection_try_register_object_path(
                                         connection, path.c_str(), &kDeferred, this, error.get());
+        if (registered) setRegistered(this, vtable->message_function);
         Connection::unref(connection);  // the registration stays on the shared connection
     }
     if (!registered) {
@@ -225,6 +249,7 @@ int Agent::unregisterPath() {
             dbus_connection_get_object_path_data(connection, path.c_str(), &owner) &&
             owner == this)
             unregistered = dbus_connection_unregister_object_path(connection, path.c_str());
+        if (unregistered) setRegistered(this, 0);
         Connection::unref(connection);
     }
     if (!unregistered) {

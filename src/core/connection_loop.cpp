@@ -60,14 +60,68 @@ std::vector<ConnectionLoop*> gLoops;  // never freed: shared connections live as
 
 // The loop whose receiving thread this thread is; null on other threads.
 thread_local ConnectionLoop* tReceiving = 0;
-// Whether this thread is inside libdbus's dispatch (an object path of other
-// code than the Agent's is called there): a wait there could never end.
-thread_local bool tInDispatch = false;
+// The loop whose connection this thread dispatches for the library (an object
+// path of other code than the Agent's is called there).
+thread_local const ConnectionLoop* tDispatching = 0;
 // The loop whose socket this thread reads at the moment.
 thread_local const ConnectionLoop* tPumping = 0;
 
 const char kInDispatchText[] =
-    "A reply cannot be waited for inside libdbus's dispatch (an object path's own handler)";
+    "A pending call cannot be waited for inside libdbus's dispatch (a handler of the connection's own)";
+
+// The messages that the program's own loop (not a thread of the library)
+// dispatches on this thread and that are still alive: while any is, the
+// thread may be inside that dispatch, whose lock a wait must not take. Counted
+// down by libdbus when a message is freed, possibly on another thread: kept
+// for the life of the process, one per such thread.
+struct ForeignDispatch {
+    std::atomic<int> alive;
+};
+typedef std::vector<std::pair<const ConnectionLoop*, ForeignDispatch*> > ForeignDispatches;
+thread_local ForeignDispatch* tForeign = 0;  // the last one used
+thread_local const ConnectionLoop* tForeignLoop = 0;
+thread_local ForeignDispatches* tForeigns = 0;
+
+dbus_int32_t foreignSlot() {
+    static const dbus_int32_t slot = [] {
+        dbus_int32_t allocated = -1;
+        dbus_message_allocate_data_slot(&allocated);
+        return allocated;
+    }();
+    return slot;
+}
+
+ForeignDispatch* foreignDispatch(const ConnectionLoop* loop, bool make) {
+    if (tForeignLoop == loop) return tForeign;
+    ForeignDispatch* found = 0;
+    for (size_t i = 0; tForeigns != 0 && i < tForeigns->size() && found == 0; ++i)
+        if ((*tForeigns)[i].first == loop) found = (*tForeigns)[i].second;
+    if (found == 0 && make) {
+        if (tForeigns == 0) tForeigns = new ForeignDispatches;
+        found = new ForeignDispatch;
+        found->alive = 0;
+        tForeigns->push_back(std::make_pair(loop, found));
+    }
+    if (found != 0) {
+        tForeignLoop = loop;
+        tForeign = found;
+    }
+    return found;
+}
+
+void foreignMessageFreed(void* data) { --static_cast<ForeignDispatch*>(data)->alive; }
+
+void noteForeignDispatch(const ConnectionLoop* loop, DBusMessage* message) {
+    ForeignDispatch* foreign = foreignDispatch(loop, true);
+    ++foreign->alive;
+    if (!dbus_message_set_data(message, foreignSlot(), foreign, &foreignMessageFreed)) --foreign->alive;
+}
+
+bool insideDispatch(const ConnectionLoop* loop) {
+    if (tDispatching == loop) return true;
+    ForeignDispatch* foreign = foreignDispatch(loop, false);
+    return foreign != 0 && foreign->alive.load() > 0;
+}
 
 // ---- uses that destruction waits for ----
 
@@ -83,28 +137,33 @@ void beginUseLocked(const void* key) {
     ownUses().push_back(key);
 }
 
-// The dispatching object of each loop, and the loops announced but whose
-// thread has not yet started (keyed by the object, never dereferenced).
-std::map<ConnectionLoop*, RemoteObject*> gOwners;
-std::multimap<const void*, ConnectionLoop*> gStarting;
-
-// The notify of a waited-for pending call: the waiting thread takes the reply.
-// The waiting thread and libdbus each hold a reference: the notify may run
-// after the wait has ended (a wait also asks the call whether it completed).
 }  // namespace
 
-struct ConnectionLoop::Waiter {
+// A receiving thread: its loop, and the object it was started on (null once
+// that is destroyed).
+struct ConnectionLoop::Receiver {
     ConnectionLoop* loop;
-    bool done;  // guarded by the loop's lock
-    std::atomic<int> references;
+    RemoteObject* object;
 };
 
 namespace {
 
-void releaseWaiter(void* data) {
-    ConnectionLoop::Waiter* waiter = static_cast<ConnectionLoop::Waiter*>(data);
-    if (--waiter->references == 0) delete waiter;
-}
+// Every receiving thread, and those announced but not yet started (keyed by
+// the object, never dereferenced).
+std::set<ConnectionLoop::Receiver*> gReceivers;
+std::multimap<const void*, ConnectionLoop::Receiver*> gStarting;
+thread_local ConnectionLoop::Receiver* tReceiver = 0;
+
+}  // namespace
+
+// A thread waiting for the reply to its call. Whoever reads or dispatches the
+// reply hands it over here, under the loop's lock.
+struct ConnectionLoop::Waiter {
+    dbus_uint32_t serial;
+    DBusMessage* reply;  // one reference owned; null until it came
+};
+
+namespace {
 
 int pollFor(DBusConnection* connection, int wakeFd, int milliseconds, bool& socketReady) {
     struct pollfd fds[2];
@@ -169,6 +228,7 @@ ConnectionLoop::ConnectionLoop(DBusConnection* connection)
       pumping_(false),
       receiverPumping_(false),
       readerWaiter_(0),
+      sending_(0),
       pumpFreeSince_(Clock::now()),
       youngCallers_(0),
       handBackAt_(),
@@ -211,8 +271,12 @@ void ConnectionLoop::onDispatchStatus(DBusConnection*, DBusDispatchStatus status
     if (status == DBUS_DISPATCH_DATA_REMAINS && tPumping != loop) loop->wake();
 }
 
-void ConnectionLoop::queue(const Work& work) {
+// For a receiving thread; a signal that the program's own loop dispatches
+// while none runs is the program's.
+void ConnectionLoop::queueSignal(DBusMessage* message) {
     std::lock_guard<std::mutex> hold(lock_);
+    if (stopped() || (receivers_ == 0 && tDispatching != this)) return;
+    Work work = { dbus_message_ref(message), 0, 0 };
     queueLocked(work);
 }
 
@@ -232,13 +296,44 @@ void ConnectionLoop::queueLocked(const Work& work) {
     changed_.notify_all();
 }
 
-// Every signal is left unhandled, so that other filters still see it.
+// Every signal is left unhandled, so that other filters still see it. A
+// reply that libdbus has no pending call for may be one a thread of ours waits
+// for.
 DBusHandlerResult ConnectionLoop::filter(DBusConnection*, DBusMessage* message, void* data) {
-    if (dbus_message_get_type(message) == DBUS_MESSAGE_TYPE_SIGNAL && !stopped()) {
-        Work work = { dbus_message_ref(message), 0, 0 };
-        static_cast<ConnectionLoop*>(data)->queue(work);
+    ConnectionLoop* loop = static_cast<ConnectionLoop*>(data);
+    if (tDispatching != loop) noteForeignDispatch(loop, message);
+    int type = dbus_message_get_type(message);
+    if (type == DBUS_MESSAGE_TYPE_SIGNAL) {
+        loop->queueSignal(message);
+    } else if (type == DBUS_MESSAGE_TYPE_METHOD_RETURN || type == DBUS_MESSAGE_TYPE_ERROR) {
+        if (loop->handOver(message)) return DBUS_HANDLER_RESULT_HANDLED;
     }
     return DBUS_HANDLER_RESULT_NOT_YET_HANDLED;
+}
+
+ConnectionLoop::Waiter* ConnectionLoop::waiterLocked(dbus_uint32_t serial) const {
+    for (size_t i = 0; i < waiters_.size(); ++i)
+        if (waiters_[i]->serial == serial) return waiters_[i];
+    return 0;
+}
+
+bool ConnectionLoop::handOver(DBusMessage* reply) {
+    dbus_uint32_t serial = dbus_message_get_reply_serial(reply);
+    bool polling;
+    {
+        std::lock_guard<std::mutex> hold(lock_);
+        Waiter* waiter = waiterLocked(serial);
+        if (waiter == 0 || waiter->reply != 0) {
+            // Its caller may have sent it and not yet said that it waits.
+            if (sending_ > 0) unclaimed_.push_back(dbus_message_ref(reply));
+            return false;
+        }
+        waiter->reply = dbus_message_ref(reply);
+        polling = readerWaiter_ == waiter && tPumping != this;
+    }
+    changed_.notify_all();
+    if (polling) wake();  // the waiting thread polls the socket
+    return true;
 }
 
 bool ConnectionLoop::handsOverLocked() const { return (receivers_ > 0 && !stopped()) || methodRunners_ > 0; }
@@ -272,13 +367,14 @@ void ConnectionLoop::runLeftMethodCalls(std::unique_lock<std::mutex>& hold) {
 }
 
 void ConnectionLoop::dispatchAll() {
-    tInDispatch = true;
+    const ConnectionLoop* outer = tDispatching;
+    tDispatching = this;
     while (dbus_connection_dispatch(connection_) == DBUS_DISPATCH_DATA_REMAINS) {
     }
-    tInDispatch = false;
+    tDispatching = outer;
 }
 
-const char* ConnectionLoop::cannotWait() { return tInDispatch ? kInDispatchText : 0; }
+const char* ConnectionLoop::cannotWait() const { return insideDispatch(this) ? kInDispatchText : 0; }
 
 DBusMessage* ConnectionLoop::takeReply(dbus_uint32_t serial) {
     DBusMessage* head = dbus_connection_borrow_message(connection_);
@@ -318,8 +414,7 @@ DBusMessage* ConnectionLoop::pump(int milliseconds, dbus_uint32_t serial, bool d
     if (dispatch) {
         // What another thread's I/O queued is dispatched before anything is
         // read; right after a call was sent, that woke this thread through the
-        // pipe. Dispatching completes the pending call of a reply, also the
-        // failed ones of a closed connection, with the local Disconnected.
+        // pipe. Dispatching hands a reply to the thread waiting for it.
         if (fresh || dbus_connection_get_dispatch_status(connection_) != DBUS_DISPATCH_DATA_REMAINS)
             readSocket(milliseconds);
         dispatchAll();
@@ -360,8 +455,7 @@ void ConnectionLoop::runWork(Work& work) {
         RemoteObject* owner = 0;
         {
             std::lock_guard<std::mutex> hold(gUseLock);
-            std::map<ConnectionLoop*, RemoteObject*>::iterator found = gOwners.find(this);
-            if (found != gOwners.end()) owner = found->second;
+            if (tReceiver != 0) owner = tReceiver->object;
             if (owner != 0) beginUseLocked(owner);
         }
         if (!stopped()) {
@@ -398,8 +492,11 @@ void ConnectionLoop::runWork(Work& work) {
 void ConnectionLoop::addReceiver(RemoteObject* owner) {
     {
         std::lock_guard<std::mutex> hold(gUseLock);
-        gOwners[this] = owner;
-        gStarting.insert(std::make_pair(static_cast<const void*>(owner), this));
+        Receiver* receiver = new Receiver;
+        receiver->loop = this;
+        receiver->object = owner;
+        gReceivers.insert(receiver);
+        gStarting.insert(std::make_pair(static_cast<const void*>(owner), receiver));
     }
     std::lock_guard<std::mutex> hold(lock_);
     ++receivers_;
@@ -408,16 +505,21 @@ void ConnectionLoop::addReceiver(RemoteObject* owner) {
 void ConnectionLoop::removeReceiver(RemoteObject* owner) {
     {
         std::lock_guard<std::mutex> hold(gUseLock);
-        std::multimap<const void*, ConnectionLoop*>::iterator found = gStarting.find(owner);
-        if (found != gStarting.end()) gStarting.erase(found);
+        std::multimap<const void*, Receiver*>::iterator found = gStarting.find(owner);
+        if (found != gStarting.end()) {
+            gReceivers.erase(found->second);
+            delete found->second;
+            gStarting.erase(found);
+        }
     }
     std::unique_lock<std::mutex> hold(lock_);
     --receivers_;
     runLeftMethodCalls(hold);
 }
 
-void ConnectionLoop::receive() {
+void ConnectionLoop::receive(Receiver* me) {
     tReceiving = this;
+    tReceiver = me;
     std::unique_lock<std::mutex> hold(lock_);
     while (!stopped()) {
         Work work;
@@ -462,49 +564,14 @@ void ConnectionLoop::receive() {
     changed_.notify_all();
     hold.unlock();
     tReceiving = 0;
+    std::lock_guard<std::mutex> held(gUseLock);
+    gReceivers.erase(me);
+    delete me;
+    tReceiver = 0;
 }
 
-void ConnectionLoop::onCompleted(DBusPendingCall*, void* data) {
-    Waiter* waiter = static_cast<Waiter*>(data);
-    ConnectionLoop* loop = waiter->loop;
-    bool polling;
-    {
-        std::lock_guard<std::mutex> hold(loop->lock_);
-        waiter->done = true;
-        polling = loop->readerWaiter_ == waiter && tPumping != loop;
-    }
-    loop->changed_.notify_all();
-    if (polling) loop->wake();  // the waiting thread polls the socket
-    // Orders this call before the waiter's release for ThreadSanitizer, which
-    // cannot see libdbus's own reference count.
-    waiter->references.fetch_add(0, std::memory_order_release);
-}
-
-ConnectionLoop::End ConnectionLoop::wait(DBusPendingCall* pending, dbus_uint32_t serial, int timeout,
-                                         bool runMethodCalls, const std::atomic<int>* interrupted,
-                                         DBusMessage** reply) {
-    Waiter* waiter = new Waiter;
-    waiter->loop = this;
-    waiter->done = false;
-    waiter->references = 2;
-    if (!dbus_pending_call_set_notify(pending, &onCompleted, waiter, &releaseWaiter))
-        releaseWaiter(waiter);  // libdbus holds none
-    DBusMessage* taken = 0;
-    End end = waitFor(pending, waiter, serial, timeout, runMethodCalls, interrupted, &taken);
-    releaseWaiter(waiter);
-    *reply = 0;
-    if (taken != 0) {
-        dbus_pending_call_cancel(pending);  // its reply was taken off the queue
-        *reply = taken;
-    } else if (end == kReplied) {
-        *reply = dbus_pending_call_steal_reply(pending);
-    }
-    return end;
-}
-
-ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, Waiter* waiter, dbus_uint32_t serial,
-                                            int timeout, bool runMethodCalls,
-                                            const std::atomic<int>* interrupted, DBusMessage** taken) {
+ConnectionLoop::End ConnectionLoop::waitFor(Waiter* waiter, int timeout, bool runMethodCalls,
+                                            const std::atomic<int>* interrupted) {
     using std::chrono::milliseconds;
     bool endless = timeout == DBUS_TIMEOUT_INFINITE;
     Clock::time_point start = Clock::now();
@@ -522,15 +589,7 @@ ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, Waiter* wa
     bool fresh = true;  // nothing read for this call yet
     End end;
     for (;;) {
-        // Also asked of the call: it may have completed before the notify was set.
-        if (waiter->done) {
-            end = kReplied;
-            break;
-        }
-        hold.unlock();
-        bool completed = dbus_pending_call_get_completed(pending);
-        hold.lock();
-        if (completed) {
+        if (waiter->reply != 0) {
             end = kReplied;
             break;
         }
@@ -579,7 +638,7 @@ ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, Waiter* wa
             receiverPumping_ = receiving;
             readerWaiter_ = waiter;
             hold.unlock();
-            DBusMessage* mine = pump(slice, serial, !young, fresh);
+            DBusMessage* mine = pump(slice, waiter->serial, !young, fresh);
             fresh = false;
             bool remains = young && dbus_connection_get_dispatch_status(connection_) == DBUS_DISPATCH_DATA_REMAINS;
             hold.lock();
@@ -592,7 +651,7 @@ ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, Waiter* wa
             // alone wakes nobody.
             if (!young || remains || youngCallers_ > 1) changed_.notify_all();
             if (mine != 0) {
-                *taken = mine;
+                waiter->reply = mine;
                 end = kReplied;
                 break;
             }
@@ -610,6 +669,8 @@ ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, Waiter* wa
         changed_.wait_until(hold, until);
     }
     if (young) --youngCallers_;
+    waiters_.erase(std::find(waiters_.begin(), waiters_.end(), waiter));
+    if (waiter->reply != 0) end = kReplied;  // it came as the wait ended
     if (runMethodCalls) {
         --methodRunners_;
         runLeftMethodCalls(hold);
@@ -617,33 +678,55 @@ ConnectionLoop::End ConnectionLoop::waitFor(DBusPendingCall* pending, Waiter* wa
     return end;
 }
 
-DBusMessage* ConnectionLoop::call(DBusMessage* message, int timeout, DBusError* error) {
-    if (const char* why = cannotWait()) {
-        dbus_set_error_const(error, DBUS_ERROR_FAILED, why);
-        return 0;
+ConnectionLoop::End ConnectionLoop::send(DBusMessage* message, int timeout, bool runMethodCalls,
+                                         const std::atomic<int>* interrupted, DBusMessage** reply) {
+    *reply = 0;
+    // A closed connection would take the message and drop it.
+    if (!dbus_connection_get_is_connected(connection_)) return kNotSent;
+    Waiter waiter = { 0, 0 };
+    {
+        std::lock_guard<std::mutex> hold(lock_);
+        ++sending_;
     }
-    DBusPendingCall* pending = 0;
-    if (!dbus_connection_send_with_reply(connection_, message, &pending, timeout) || pending == 0) {
-        dbus_set_error_const(error, DBUS_ERROR_DISCONNECTED, "Connection is closed");
-        return 0;
+    bool sent = dbus_connection_send(connection_, message, &waiter.serial) != 0;
+    {
+        std::lock_guard<std::mutex> hold(lock_);
+        if (sent) waiters_.push_back(&waiter);
+        // Replies dispatched while their callers were between sending and
+        // waiting.
+        for (size_t i = 0; i < unclaimed_.size(); ++i) {
+            if (sent && waiter.reply == 0 && dbus_message_get_reply_serial(unclaimed_[i]) == waiter.serial) {
+                waiter.reply = unclaimed_[i];
+                unclaimed_.erase(unclaimed_.begin() + static_cast<std::ptrdiff_t>(i));
+                break;
+            }
+        }
+        if (--sending_ == 0) {
+            for (size_t i = 0; i < unclaimed_.size(); ++i) dbus_message_unref(unclaimed_[i]);
+            unclaimed_.clear();
+        }
     }
+    if (!sent) return kNotSent;
     // Sending wrote what it could; what is left is written by the wait's reads.
     if (dbus_connection_has_messages_to_send(connection_)) dbus_connection_flush(connection_);
+    End end = waitFor(&waiter, timeout, runMethodCalls, interrupted);
+    *reply = waiter.reply;
+    return end;
+}
+
+DBusMessage* ConnectionLoop::call(DBusMessage* message, int timeout, DBusError* error) {
+    // Dispatching, or taking a reply off the queue, would wait for the
+    // dispatch this thread is in: libdbus's own wait reads the reply alone.
+    if (insideDispatch(this)) return dbus_connection_send_with_reply_and_block(connection_, message, timeout, error);
     DBusMessage* reply = 0;
-    End end = wait(pending, dbus_message_get_serial(message), timeout, false, 0, &reply);
-    if (end != kReplied) {
-        dbus_pending_call_cancel(pending);  // a late reply is dropped
-        if (end == kClosed)
-            dbus_set_error_const(error, DBUS_ERROR_DISCONNECTED, "Connection is closed");
-        else
-            dbus_set_error_const(error, DBUS_ERROR_NO_REPLY, kNoReplyText);
-    }
-    dbus_pending_call_unref(pending);
+    End end = send(message, timeout, false, 0, &reply);
+    if (end == kClosed || end == kNotSent)
+        dbus_set_error_const(error, DBUS_ERROR_DISCONNECTED, "Connection is closed");
+    else if (end != kReplied)
+        dbus_set_error_const(error, DBUS_ERROR_NO_REPLY, kNoReplyText);
     if (reply != 0 && dbus_set_error_from_message(error, reply)) {
         dbus_message_unref(reply);
         reply = 0;
-    } else if (reply == 0 && !dbus_error_is_set(error)) {
-        dbus_set_error_const(error, DBUS_ERROR_NO_REPLY, kNoReplyText);
     }
     return reply;
 }
@@ -679,9 +762,8 @@ bool ConnectionLoop::stopped() { return gStop.load() != 0; }
 
 void ConnectionLoop::forgetOwner(RemoteObject* owner) {
     std::lock_guard<std::mutex> hold(gUseLock);
-    for (std::map<ConnectionLoop*, RemoteObject*>::iterator it = gOwners.begin(); it != gOwners.end();
-         ++it)
-        if (it->second == owner) it->second = 0;
+    for (std::set<Receiver*>::iterator it = gReceivers.begin(); it != gReceivers.end(); ++it)
+        if ((*it)->object == owner) (*it)->object = 0;
 }
 
 void ConnectionLoop::forgetMethodCalls(void* data) {
@@ -711,17 +793,17 @@ void ConnectionLoop::forgetMethodCalls(void* data) {
 // The thread function of startLoop. The object is only a key here: it may be
 // destroyed while its thread runs.
 void* receiveSignal(void* object) {
-    internal::ConnectionLoop* loop = 0;
+    internal::ConnectionLoop::Receiver* receiver = 0;
     {
         std::lock_guard<std::mutex> hold(internal::gUseLock);
-        std::multimap<const void*, internal::ConnectionLoop*>::iterator found =
+        std::multimap<const void*, internal::ConnectionLoop::Receiver*>::iterator found =
             internal::gStarting.find(object);
         if (found != internal::gStarting.end()) {
-            loop = found->second;
+            receiver = found->second;
             internal::gStarting.erase(found);
         }
     }
-    if (loop != 0) loop->receive();
+    if (receiver != 0) receiver->loop->receive(receiver);
     return 0;
 }
 

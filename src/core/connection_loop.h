@@ -6,6 +6,7 @@
 #include <condition_variable>
 #include <deque>
 #include <mutex>
+#include <vector>
 
 #include <dbus/dbus.h>
 
@@ -32,24 +33,26 @@ public:
     // process (shared connections live that long).
     static ConnectionLoop* of(DBusConnection* connection);
 
-    enum End { kReplied, kTimedOut, kInterrupted, kClosed };
+    enum End { kReplied, kTimedOut, kInterrupted, kClosed, kNotSent };
     // What the notify of a waited-for call shares with the waiting thread.
     struct Waiter;
 
-    // Sends message and waits for its reply; a D-Bus error, a time-out or a
-    // closed connection gives null with error set. timeout as libdbus takes it.
+    // Sends message and waits for its reply, at most timeout (libdbus's
+    // meaning), or until *interrupted is set. On kReplied, *reply is the reply,
+    // owned by the caller; a reply that comes later is dropped. kNotSent: the
+    // connection was closed; kClosed: it closed during the wait.
+    // runMethodCalls: answer deferred method calls (the Agent's) meanwhile on
+    // this thread.
+    End send(DBusMessage* message, int timeout, bool runMethodCalls, const std::atomic<int>* interrupted,
+             DBusMessage** reply);
+    // A blocking call: the reply, or null with error set as libdbus words a
+    // D-Bus error, a time-out or a closed connection. Inside a dispatch it waits
+    // as libdbus does, dispatching nothing.
     DBusMessage* call(DBusMessage* message, int timeout, DBusError* error);
-    // Waits for the reply to pending (the call of serial), at most timeout
-    // (libdbus's meaning), or until *interrupted is set. On kReplied, *reply is
-    // the reply (owned by the caller; null if libdbus kept none); on any other
-    // end the call is left to the caller to cancel. runMethodCalls: answer
-    // deferred method calls (the Agent's) meanwhile on this thread.
-    End wait(DBusPendingCall* pending, dbus_uint32_t serial, int timeout, bool runMethodCalls,
-             const std::atomic<int>* interrupted, DBusMessage** reply);
 
-    // Why this thread cannot wait for a reply now (it is inside libdbus's
-    // dispatch), or null.
-    static const char* cannotWait();
+    // Why this thread cannot wait for a pending call now (it is inside
+    // libdbus's dispatch: the library's, or the program's own loop's), or null.
+    const char* cannotWait() const;
 
     // A method call for a thread that may run callers' code; the Agent's
     // object path dispatches through this. It is queued for a receiving thread
@@ -63,7 +66,8 @@ public:
     // the dispatching object), run it on the thread.
     void addReceiver(RemoteObject* owner);
     void removeReceiver(RemoteObject* owner);  // its thread could not start
-    void receive();
+    struct Receiver;
+    void receive(Receiver* me);
 
     // Work waiting for a thread to run it.
     size_t queued();
@@ -101,7 +105,7 @@ private:
     void runWork(Work& work);
     // Pops the first work item that may run on this thread; false if none.
     bool takeWork(bool methodCallsOnly, Work& work);
-    void queue(const Work& work);
+    void queueSignal(DBusMessage* message);
     void queueLocked(const Work& work);
     // Whether a thread of ours will run queued method calls.
     bool handsOverLocked() const;
@@ -110,12 +114,13 @@ private:
     void wake();
     bool mayPump(bool receiving, Clock::time_point now) const;
     bool mayDispatch(bool receiving, Clock::time_point now) const;
-    End waitFor(DBusPendingCall* pending, Waiter* waiter, dbus_uint32_t serial, int timeout,
-                bool runMethodCalls, const std::atomic<int>* interrupted, DBusMessage** taken);
+    End waitFor(Waiter* waiter, int timeout, bool runMethodCalls, const std::atomic<int>* interrupted);
+    // Gives a reply that a thread waits for to that thread; false if none does.
+    bool handOver(DBusMessage* reply);
+    Waiter* waiterLocked(dbus_uint32_t serial) const;
 
     static DBusHandlerResult filter(DBusConnection*, DBusMessage* message, void* data);
     static void onDispatchStatus(DBusConnection*, DBusDispatchStatus status, void* data);
-    static void onCompleted(DBusPendingCall*, void* data);
 
     DBusConnection* const connection_;
     int wake_[2];  // wakes the thread that polls the socket
@@ -125,6 +130,9 @@ private:
     bool pumping_;                     // a thread reads the connection
     bool receiverPumping_;             // ... and it is a receiving thread
     const Waiter* readerWaiter_;       // ... or it waits for this reply
+    std::vector<Waiter*> waiters_;     // threads waiting for replies
+    int sending_;                      // threads between sending a call and waiting
+    std::vector<DBusMessage*> unclaimed_;  // replies dispatched meanwhile
     Clock::time_point pumpFreeSince_;
     // Threads that began waiting for a reply beside a receiving thread a moment
     // ago read the socket themselves, so that a quick reply wakes one thread,

@@ -53,6 +53,10 @@ RemoteObject::RemoteObject(const char* destination, const char* path, const char
       operationDepth(0),
       handlersReleased(false) {
     connection = Connection::get(busType);
+    // The loop's filter sees every dispatch from now on, also those of a loop
+    // of the program's own, so that a wait never takes a dispatch lock that
+    // its thread holds.
+    if (connection != 0) internal::ConnectionLoop::of(connection);
 }
 
 RemoteObject::~RemoteObject() {

@@ -498,7 +498,7 @@ std::string ScannerServer::getInfoFromMap(std::string& address) {
 bool ScannerServer::callbackThreadHandler(void*) {
     {
         Service::Hold hold(stateLock);
-        if (--countdown > 0) return true;
+        if (--countdown != 0) return true;
     }
     quitLoop();
     return false;
