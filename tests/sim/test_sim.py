@@ -188,7 +188,8 @@ class BluezTest(SimTestCase):
         self.control('Reset')
         self.assertLess(time.monotonic() - started, 0.5)
         self.assertEqual(self.call('/', 'org.bluez.Manager', 'ListAdapters'), [self.adapter])
-        self.assertTrue(self.call(self.adapter, ADAPTER, 'GetProperties')['Powered'])
+        self.assertEqual(list(self.call(self.adapter, ADAPTER, 'GetProperties').items())[:4], [
+            ('Address', '00:1A:7D:DA:71:13'), ('Name', 'btbus-sim'), ('Class', 0x5a010c), ('Powered', True)])
         # In range again: an out-of-range headset could not ask for a connection.
         self.assertEqual(self.control('IncomingConnection', 'hci0', HEADSET, '110b'), E + 'AgentNotAvailable')
 
