@@ -31,7 +31,6 @@ class Launcher:
     """One running bluez4-sim launcher, once it said `ready`, and the addresses it exported."""
 
     def __init__(self, *extra_args, env=None):
-        started = time.monotonic()
         with tempfile.NamedTemporaryFile('w', suffix='.env', delete=False) as out:
             self.env_file = out.name
             self.proc = subprocess.Popen(
@@ -41,7 +40,6 @@ class Launcher:
             if not line:
                 raise RuntimeError(f'the launcher exited early ({self.proc.wait()})')
             sys.stderr.write(line)
-        self.startup_seconds = time.monotonic() - started
         self.relay = threading.Thread(target=shutil.copyfileobj, args=(self.proc.stderr, sys.stderr))
         self.relay.start()
         with open(self.env_file, encoding='utf-8') as f:  # only export lines, for `.` to read

@@ -6,7 +6,6 @@ import pathlib
 import signal
 import subprocess
 import tempfile
-import time
 import unittest
 
 import dbus
@@ -52,7 +51,6 @@ class LauncherTest(unittest.TestCase):
         pathlib.Path(scratch, 'org.btbus.Activated.service').write_text(SERVICE)
         launcher = Launcher('--service-dir', scratch)
         self.addCleanup(launcher.stop)
-        self.assertLess(launcher.startup_seconds, 3.0)
         children = children_of(launcher.proc.pid)
         self.assertEqual(sorted(map(command_of, children)), ['dbus-daemon', 'dbus-daemon', 'python3'])
         simulator = [pid for pid in children if command_of(pid) == 'python3'][0]
@@ -176,7 +174,7 @@ class BluezTest(SimTestCase):
                           and args[0] in ('Name', 'Address', 'Powered', 'DiscoverableTimeout', 'Pairable')],
                          [['Name', 'renamed'], ['Pairable', False], ['Powered', False]])
 
-    def test_adapters_come_and_go_with_the_managers_signals_and_reset_restores_the_scene_at_once(self):
+    def test_adapters_come_and_go_with_the_managers_signals_and_reset_restores_the_scene(self):
         self.call(self.adapter, ADAPTER, 'SetProperty', 'Powered', dbus.Boolean(False, variant_level=1))
         self.control('SetInRange', 'hci0', HEADSET, False)
         self.assertRegex(self.control('AddAdapter', 'hci1', '00:11:22:33:44:01'), r'^/org/bluez/\d+/hci1$')
@@ -184,9 +182,7 @@ class BluezTest(SimTestCase):
         self.drain()
         self.assertEqual([member for path, _i, member, _a in self.signals if path == '/'],
                          'AdapterAdded PropertyChanged PropertyChanged DefaultAdapterChanged AdapterRemoved'.split())
-        started = time.monotonic()
         self.control('Reset')
-        self.assertLess(time.monotonic() - started, 0.5)
         self.assertEqual(self.call('/', 'org.bluez.Manager', 'ListAdapters'), [self.adapter])
         self.assertEqual(list(self.call(self.adapter, ADAPTER, 'GetProperties').items())[:4], [
             ('Address', '00:1A:7D:DA:71:13'), ('Name', 'btbus-sim'), ('Class', 0x5a010c), ('Powered', True)])

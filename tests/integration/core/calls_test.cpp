@@ -96,6 +96,7 @@ TEST_F(ARemoteObject, DecodesDictionariesInArrivalOrderUpToAValueItCannotHold) {
           "RSSI=5:-60;Vendor=1:65535;Adapter=3:/org/bluez/1/hci0;Devices=4:[/d/1, /d/2];Empty=4:[];" },
         { "a{sv}", R"({"A": ["u", 1], "B": ["u", 2], "": ["u", 3], "C": ["u", 4]})", 0, 0, "A=0:1;B=0:2;" },
         { "a{uv}", R"({"1": ["s", "one"], "2": ["u", 2]})", 0, 0, "1=3:one;2=0:2;" },
+        { "a{us}", R"({"65537": "<record/>", "2": "two"})", 0, 0, "65537=3:<record/>;2=3:two;" },  // services
         // The entries before a value it cannot hold are kept.
         { "a{sv}", R"({"Name": ["s", "before"], "Bad": ["y", 3], "After": ["s", "x"]})", -1, 4, "Name=3:before;" },
         { "a{sv}", R"({"Level": ["i", -1]})", -1, 4, "" },

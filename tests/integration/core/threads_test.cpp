@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <atomic>
 #include <chrono>
+#include <cstdarg>
 #include <thread>
 
 #include <gtest/gtest.h>
@@ -72,14 +73,24 @@ void callFromHandler(RemoteObject*, const char*) {
     gPendingMs = millisecondsSince(start);
 }
 
+// Inside libdbus's dispatch a blocking call waits as libdbus does, and a
+// pending call, which would have to dispatch, fails at once.
+std::string callInsideDispatch() {
+    RemoteObject bus("org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus", DBUS_BUS_SESSION);
+    std::string id;
+    bool answered = bus.newMessage("GetId") == 0 && bus.sendMessage(true, 3000) == 0 && bus.getReplyValue(id) == 0;
+    bus.newMessage("GetId");
+    auto start = Clock::now();
+    bool refused = bus.sendMessagePending() == -1 && bus.getErrorNumber() == 11;
+    return std::string(answered && id.size() == 32 ? "answered" : "not answered") +
+           (refused && millisecondsSince(start) < kPromptMs ? ", refused at once" : ", not refused");
+}
+
 std::atomic<std::thread::id> gCallBackThread{};
-std::string gInDispatchError;
+std::string gInDispatch;
 DBusHandlerResult answerCallBack(DBusConnection* connection, DBusMessage* call, void*) {
     gCallBackThread = std::this_thread::get_id();
-    auto object = peerObject();
-    buildCall(*object, "Echo", "inside");
-    object->sendMessage(true, -1);
-    gInDispatchError = object->getErrorName();
+    gInDispatch = callInsideDispatch();
     DBusMessage* reply = dbus_message_new_method_return(call);
     const char* text = "pong";
     dbus_message_append_args(reply, DBUS_TYPE_STRING, &text, DBUS_TYPE_INVALID);
@@ -108,8 +119,7 @@ TEST_F(TheReceivingThreadBesideCalls, RunsCallBacksAndHandlersThatMayCallOutside
     EXPECT_EQ(peer->getReplyValue(answer), 0);
     EXPECT_EQ(answer, "called back: pong");
     EXPECT_NE(gCallBackThread.load(), std::this_thread::get_id());
-    // Inside libdbus's dispatch a wait would never end: the call fails at once.
-    EXPECT_EQ(gInDispatchError, "org.freedesktop.DBus.Error.Failed");
+    EXPECT_EQ(gInDispatch, "answered, refused at once");
     dbus_connection_unregister_object_path(peer->getConnection(), "/org/btbus/CallBack");
 }
 
@@ -181,6 +191,25 @@ TEST_F(TheReceivingThreadBesideCalls, KeepsBlockingCallsPromptWhileAPendingCallA
     dbus_connection_unref(newcomer);
 }
 
+std::atomic<bool> gNapping{ false };
+void nap(RemoteObject*, const char*) {
+    gNapping = true;
+    std::this_thread::sleep_for(1500ms);
+    gNapping = false;
+}
+
+// A reply slower than a caller's own first reads, while the only receiving
+// thread sleeps in a handler: the waiting thread takes the socket over.
+TEST_F(TheReceivingThreadBesideCalls, ReadsASlowReplyItselfWhileTheReceivingThreadSleepsInAHandler) {
+    ASSERT_EQ(peer->setSignalHandlerString("Nap", &nap), 0);
+    emit("Nap", "s", R"(["now"])");
+    ASSERT_TRUE(waitUntil([] { return gNapping.load(); }));
+    auto start = Clock::now();
+    callPeer(*peer, "Later", 100u);
+    EXPECT_LT(millisecondsSince(start), 100 + kPromptMs);
+    EXPECT_TRUE(gNapping.load()) << "the handler woke before the reply: the test proves nothing";
+}
+
 TEST_F(TheReceivingThreadBesideCalls, LeavesAnOperationOnTheLoopsObjectItsOutcomeWhenASignalFailsToDecode) {
     ASSERT_EQ(peer->setSignalHandlerStringVariant("PropertyChanged", [](RemoteObject*, const char*, const Variant*) {}),
               0);
@@ -227,6 +256,68 @@ TEST(APendingCallToAPeerThatNeverAnswers, EndsAtTheDefaultTimeOutWithOrWithoutAL
     check(loopOwner().getConnection(), DBUS_BUS_SESSION);
     withoutLoop.join();
     dbus_connection_unref(system);
+}
+
+std::atomic<bool> gFilterCalled{ false };
+DBusHandlerResult callFromProgramsFilter(DBusConnection*, DBusMessage* message, void*) {
+    if (dbus_message_is_signal(message, kPeer, "Poke")) {
+        gInDispatch = callInsideDispatch();
+        gFilterCalled = true;
+    }
+    return DBUS_HANDLER_RESULT_NOT_YET_HANDLED;
+}
+
+// Calls the peer through a connection the library does not use.
+void callAside(DBusConnection* aside, const char* member, int first, ...) {
+    DBusMessage* call = dbus_message_new_method_call(kPeer, kPeerPath, kPeer, member);
+    va_list arguments;
+    va_start(arguments, first);
+    dbus_message_append_args_valist(call, first, arguments);
+    va_end(arguments);
+    DBusMessage* reply = dbus_connection_send_with_reply_and_block(aside, call, 3000, nullptr);
+    EXPECT_NE(reply, nullptr) << member;
+    if (reply != nullptr) dbus_message_unref(reply);
+    dbus_message_unref(call);
+}
+
+// Without a receiving thread, a program that dispatches the connection with a
+// loop of its own keeps its signals, and may call the library inside its
+// dispatch (its own filter here, as dbus-glib's callbacks run).
+TEST(AProgramsOwnLoop, KeepsItsSignalsAndMayCallTheLibraryInsideItsDispatch) {
+    if (childRole() != "own-loop") {
+        EXPECT_EQ(runInChild("AProgramsOwnLoop.*", "own-loop"), 0);
+        return;
+    }
+    startPeer();
+    auto peer = peerObject();
+    gCalls = 0;
+    ASSERT_EQ(peer->setSignalHandlerString("Tick", &count), 0);
+    DBusConnection* session = peer->getConnection();
+    dbus_bus_add_match(session, "type='signal',member='Poke'", nullptr);
+    ASSERT_TRUE(dbus_connection_add_filter(session, &callFromProgramsFilter, nullptr, nullptr));
+    std::atomic<bool> dispatching{ true };
+    std::thread loop([&] {
+        while (dispatching) dbus_connection_read_write_dispatch(session, 20);
+    });
+    DBusConnection* aside = dbus_bus_get_private(DBUS_BUS_SESSION, nullptr);
+    ASSERT_NE(aside, nullptr);
+    const char *path = kPeerPath, *poke = "Poke", *signature = "s", *arguments = R"(["now"])";
+    callAside(aside, "Emit", DBUS_TYPE_OBJECT_PATH, &path, DBUS_TYPE_STRING, &poke, DBUS_TYPE_STRING, &signature,
+              DBUS_TYPE_STRING, &arguments, DBUS_TYPE_INVALID);
+    ASSERT_TRUE(waitUntil([] { return gFilterCalled.load(); }));
+    EXPECT_EQ(gInDispatch, "answered, refused at once");
+    dbus_uint32_t interval = 1;
+    callAside(aside, "StartTicking", DBUS_TYPE_UINT32, &interval, DBUS_TYPE_INVALID);
+    std::this_thread::sleep_for(300ms);
+    callAside(aside, "StopTicking", DBUS_TYPE_INVALID);
+    std::this_thread::sleep_for(100ms);
+    dispatching = false;
+    loop.join();
+    EXPECT_EQ(internal::ConnectionLoop::of(session)->queued(), 0u) << "signals kept for a receiving thread to come";
+    EXPECT_EQ(gCalls.load(), 0);
+    dbus_connection_remove_filter(session, &callFromProgramsFilter, nullptr);
+    dbus_connection_close(aside);
+    dbus_connection_unref(aside);
 }
 
 // Stopping is final for the process, so this runs in a child of its own.
