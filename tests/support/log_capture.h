@@ -14,7 +14,6 @@ public:
     ~LogCapture();
     std::vector<std::string> lines() const;
     size_t count(const std::string& line) const;
-    bool contains(const std::string& line) const { return count(line) != 0; }
     // Lines that end with text (the "file:line " prefix aside).
     size_t countEndingWith(const std::string& text) const;
     // The messages of the lines "file:<line> message" from file, in order.

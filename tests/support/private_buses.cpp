@@ -79,9 +79,6 @@ void PrivateBuses::SetUp() {
 
 void PrivateBuses::TearDown() { stopBuses(); }
 
-const std::string& PrivateBuses::systemAddress() { return gBuses[0].address; }
-const std::string& PrivateBuses::sessionAddress() { return gBuses[1].address; }
-
 void PrivateBuses::killSessionBus() {
     stop(gBuses[1].pid, SIGKILL);
     gBuses[1].pid = -1;

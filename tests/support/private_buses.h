@@ -16,8 +16,6 @@ class PrivateBuses : public ::testing::Environment {
 public:
     void SetUp() override;
     void TearDown() override;
-    static const std::string& systemAddress();
-    static const std::string& sessionAddress();
     // Kills the session bus's daemon (SIGKILL), as a session that ends at once.
     static void killSessionBus();
 };

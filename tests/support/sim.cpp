@@ -69,8 +69,6 @@ bool control(const char* method, Read read, const A&... args) {
 
 int noReply(RemoteObject&) { return 0; }
 
-std::string textReply(bool ok, const std::string& text) { return ok ? text : std::string(); }
-
 }  // namespace
 
 namespace sim {
@@ -120,7 +118,7 @@ std::string addAdapter(const std::string& name, const std::string& address) {
     ObjectPath path;
     bool ok = control("AddAdapter", [&](RemoteObject& o) { return o.getReplyValue(path); },
                       name.c_str(), address.c_str());
-    return textReply(ok, path.str());
+    return ok ? path.str() : std::string();
 }
 
 void removeAdapter(const std::string& name) { control("RemoveAdapter", &noReply, name.c_str()); }
@@ -135,23 +133,6 @@ void setInRange(const std::string& adapter, const std::string& address, bool inR
 
 void setPlaying(const std::string& adapter, const std::string& address, bool playing) {
     control("SetPlaying", &noReply, adapter.c_str(), address.c_str(), playing);
-}
-
-// The remote device's side. The simulator answers once this process's agent
-// has answered, which the receiving thread does while this call waits.
-std::string startIncomingPairing(const std::string& adapter, const std::string& address) {
-    std::string answer;
-    bool ok = control("StartIncomingPairing", [&](RemoteObject& o) { return o.getReplyValue(answer); },
-                      adapter.c_str(), address.c_str());
-    return textReply(ok, answer);
-}
-
-std::string incomingConnection(const std::string& adapter, const std::string& address,
-                               const std::string& uuid) {
-    std::string answer;
-    bool ok = control("IncomingConnection", [&](RemoteObject& o) { return o.getReplyValue(answer); },
-                      adapter.c_str(), address.c_str(), uuid.c_str());
-    return textReply(ok, answer);
 }
 
 void emitSignal(const std::string& path, const std::string& interface, const std::string& member,

@@ -44,11 +44,6 @@ void removeAdapter(const std::string& name);
 void addDevice(const std::string& adapter, const std::string& json);
 void setInRange(const std::string& adapter, const std::string& address, bool inRange);
 void setPlaying(const std::string& adapter, const std::string& address, bool playing);
-// Requests a remote device starts; they wait for this process's agent, which
-// the receiving thread serves (answers: "accepted", "trusted", an error name).
-std::string startIncomingPairing(const std::string& adapter, const std::string& address);
-std::string incomingConnection(const std::string& adapter, const std::string& address,
-                               const std::string& uuid);
 void emitSignal(const std::string& path, const std::string& interface, const std::string& member,
                 const std::string& signature, const std::string& jsonArgs);
 std::vector<std::string> callLog();
