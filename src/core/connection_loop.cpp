@@ -56,7 +56,8 @@ namespace {
 std::atomic<int> gStop(0);
 
 std::mutex gLoopsLock;
-std::vector<ConnectionLoop*> gLoops;  // never freed: shared connections live as long
+// Never freed: shared connections live as long.
+std::vector<ConnectionLoop*>& gLoops = *new std::vector<ConnectionLoop*>;
 
 // The loop whose receiving thread this thread is; null on other threads.
 thread_local ConnectionLoop* tReceiving = 0;
@@ -72,15 +73,16 @@ const char kInDispatchText[] =
 // The messages that the program's own loop (not a thread of the library)
 // dispatches on this thread and that are still alive: while any is, the
 // thread may be inside that dispatch, whose lock a wait must not take. Counted
-// down by libdbus when a message is freed, possibly on another thread: kept
-// for the life of the process, one per such thread.
+// down by libdbus when it frees a message, possibly on another thread and
+// after this one ended: kept as long as the process, one per such thread and
+// connection.
 struct ForeignDispatch {
+    const ConnectionLoop* loop;
     std::atomic<int> alive;
 };
-typedef std::vector<std::pair<const ConnectionLoop*, ForeignDispatch*> > ForeignDispatches;
-thread_local ForeignDispatch* tForeign = 0;  // the last one used
-thread_local const ConnectionLoop* tForeignLoop = 0;
-thread_local ForeignDispatches* tForeigns = 0;
+std::mutex gForeignLock;
+std::vector<ForeignDispatch*>& gForeignDispatches = *new std::vector<ForeignDispatch*>;
+thread_local std::vector<ForeignDispatch*> tForeignDispatches;
 
 dbus_int32_t foreignSlot() {
     static const dbus_int32_t slot = [] {
@@ -92,21 +94,18 @@ dbus_int32_t foreignSlot() {
 }
 
 ForeignDispatch* foreignDispatch(const ConnectionLoop* loop, bool make) {
-    if (tForeignLoop == loop) return tForeign;
-    ForeignDispatch* found = 0;
-    for (size_t i = 0; tForeigns != 0 && i < tForeigns->size() && found == 0; ++i)
-        if ((*tForeigns)[i].first == loop) found = (*tForeigns)[i].second;
-    if (found == 0 && make) {
-        if (tForeigns == 0) tForeigns = new ForeignDispatches;
-        found = new ForeignDispatch;
-        found->alive = 0;
-        tForeigns->push_back(std::make_pair(loop, found));
+    for (size_t i = 0; i < tForeignDispatches.size(); ++i)
+        if (tForeignDispatches[i]->loop == loop) return tForeignDispatches[i];
+    if (!make) return 0;
+    ForeignDispatch* made = new ForeignDispatch;
+    made->loop = loop;
+    made->alive = 0;
+    {
+        std::lock_guard<std::mutex> hold(gForeignLock);
+        gForeignDispatches.push_back(made);
     }
-    if (found != 0) {
-        tForeignLoop = loop;
-        tForeign = found;
-    }
-    return found;
+    tForeignDispatches.push_back(made);
+    return made;
 }
 
 void foreignMessageFreed(void* data) { --static_cast<ForeignDispatch*>(data)->alive; }
