@@ -1,6 +1,7 @@
 // btbus-scanner against bluez4-sim, started by the test or by the session bus and asked through the
 // Scanner client, raw calls and third-party clients; and the service object base beneath it.
 #include <atomic>
+#include <future>
 #include <map>
 #include <memory>
 #include <set>
@@ -144,7 +145,8 @@ protected:
 };
 
 // The mouse of the scene, paired, is one of BlueZ's device objects: never
-// listed. A new bluetoothd has new adapter paths and knows nothing the old one
+// listed. A bluetoothd that hangs and goes ends a waiting ListDevices with an
+// error; a new one has new adapter paths and knows nothing the old one
 // found; an adapter it lacks leaves its finder empty until it comes.
 TEST_F(AScannerDaemon, FollowsDiscoveryPairingRangeAndANewBluetoothd) {
     using sim::kHeadset, sim::kKeyboard, sim::kPhone;
@@ -157,7 +159,12 @@ TEST_F(AScannerDaemon, FollowsDiscoveryPairingRangeAndANewBluetoothd) {
     sim::setInRange("hci0", kKeyboard, true);
     EXPECT_TRUE(listsExactly("hci0", { kHeadset, kKeyboard }));
     EXPECT_EQ(callScanner("ListDevices", "hci1").error, "");
+    // A bluetoothd that hangs, then goes, ends a ListDevices that waits for it with an error.
+    sim::freeze(true);
+    auto waiting = std::async(std::launch::async, [] { return callScanner("ListDevices", "hci0"); });
     sim::kill();
+    ASSERT_EQ(waiting.wait_for(scaled(10s)), std::future_status::ready);
+    EXPECT_NE(waiting.get().errorName, "");
     ASSERT_TRUE(sim::start());
     sim::setInRange("hci0", kKeyboard, false);
     EXPECT_TRUE(listsExactly("hci0", { kHeadset, kPhone }));  // found by discovery on the new hci0
