@@ -106,3 +106,14 @@ TEST(TheAdapterAndDeviceLists, DeleteTheirElementsFrontToBackSkippingNullOnes) {
 }
 
 }  // namespace
+
+namespace {
+
+TEST(AScannerServerWithoutBluetoothd, LogsThatItHasNoManagerAndIsNotReady) {
+    LogCapture log;
+    { Bluetooth::ScannerServer server; }
+    EXPECT_EQ(log.count("scanner_server.cpp:262 failed to get manager"), 1u) << ::testing::PrintToString(log.lines());
+    EXPECT_EQ(log.count("scanner_server.cpp:224 Failed to initial the ScannerServer"), 1u);
+}
+
+}  // namespace
