@@ -23,7 +23,8 @@ def load(mock, parameters):
     mock.ticks, mock.ticker = 0, None
     mock.AddMethods(MAIN_IFACE, [
         ('Nothing', '', '', lambda self: None), ('Fail', '', '', fail), ('Echo', 's', 's', lambda self, text: text),
-        ('Describe', 'bsouqv', 's', describe), ('CallBack', 'so', 's', call_back),
+        ('Describe', 'bsouqv', 's', lambda self, *arguments: ', '.join(repr(a) for a in arguments)),
+        ('CallBack', 'so', 's', call_back),
         ('StartTicking', 'u', '', start_ticking), ('StopTicking', '', 's', stop_ticking)])
 
 
@@ -50,10 +51,6 @@ def Later(self, milliseconds, reply, error):
 
 def fail(self):
     raise dbus.exceptions.DBusException('peer says no', name='org.btbus.Error.Failed')
-
-
-def describe(self, *arguments):
-    return ', '.join(repr(a) for a in arguments)
 
 
 def call_back(self, name, path):

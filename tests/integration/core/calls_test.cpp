@@ -136,9 +136,7 @@ TEST_F(ARemoteObject, KeepsThePeersErrorNameAndTextWhetherTheCallBlockedOrWasPen
     buildCall(*peer, "Echo", "kept");
     EXPECT_EQ(peer->newMessage(nullptr), -1);
     ASSERT_EQ(peer->sendMessage(true, -1), 0);
-    std::string text;
-    EXPECT_EQ(peer->getReplyValue(text), 0);
-    EXPECT_EQ(text, "kept");
+    EXPECT_EQ(replyText(*peer), "kept");
 }
 
 TEST_F(ARemoteObject, WritesEachArgumentWithTheTypeTheBusCarries) {
@@ -151,9 +149,7 @@ TEST_F(ARemoteObject, WritesEachArgumentWithTheTypeTheBusCarries) {
     for (const auto& row : kVariants) {
         callPeer(*peer, "Describe", true, "text", ObjectPath("/a/b"), 4000000001u, static_cast<unsigned short>(65281),
                  row.first);
-        std::string text;
-        EXPECT_EQ(peer->getReplyValue(text), 0);
-        EXPECT_EQ(text, std::string("dbus.Boolean(True), dbus.String('text'), dbus.ObjectPath('/a/b'), "
+        EXPECT_EQ(replyText(*peer), std::string("dbus.Boolean(True), dbus.String('text'), dbus.ObjectPath('/a/b'), "
                                     "dbus.UInt32(4000000001), dbus.UInt16(65281), ") + row.second);
     }
 }
@@ -179,8 +175,7 @@ TEST_F(ARemoteObject, GivesUpOnACallThatTimesOutOrIsInterruptedAndDropsItsLateRe
 
     // Both late replies arrive during the next call.
     callPeer(*peer, "Later", 2000u);
-    EXPECT_EQ(peer->getReplyValue(text), 0);
-    EXPECT_EQ(text, "2000");
+    EXPECT_EQ(replyText(*peer), "2000");
 }
 
 }  // namespace

@@ -50,6 +50,12 @@ void callPeer(Bluetooth::RemoteObject& peer, const char* method, const A&... arg
     ASSERT_EQ(peer.sendMessage(true, -1), 0) << method << ": " << peer.getErrorMessage();
 }
 
+// The reply's string, read once; when it has none, the reason.
+inline std::string replyText(Bluetooth::RemoteObject& peer) {
+    std::string text;
+    return peer.getReplyValue(text) == 0 ? text : "no text: " + peer.getErrorMessage();
+}
+
 // A JSON dictionary of count entries "k0", "k1"... that each hold value.
 inline std::string manyEntries(int count, const std::string& value) {
     std::string json = "{";
