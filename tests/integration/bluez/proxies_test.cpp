@@ -27,11 +27,7 @@
 namespace {
 
 using namespace Bluetooth;
-using btbus_test::LogCapture;
-using btbus_test::SimTest;
-using btbus_test::waitUntil;
-using namespace std::chrono_literals;
-namespace sim = btbus_test::sim;
+using namespace btbus_test;
 using sim::kFarLaptop, sim::kHeadset, sim::kKeyboard, sim::kMouse, sim::kPhone;
 
 const char kSecondAddress[] = "00:1A:7D:DA:71:14";
@@ -50,6 +46,20 @@ std::string printedUntil(int count, const std::function<void()>& run) {
 }
 bool printed(const std::string& out, const std::string& line) { return out.find(line) != std::string::npos; }
 
+// The path of the proxy, or the paths of the list, that a call returned, which
+// these then destroy: "none" for a null one.
+std::string pathOf(RemoteObject* returned) {
+    std::unique_ptr<RemoteObject> owned(returned);
+    return owned ? owned->getPath() : "none";
+}
+template <typename List>
+std::vector<std::string> pathsOf(List* returned) {
+    std::unique_ptr<List> owned(returned);
+    std::vector<std::string> paths;
+    for (size_t i = 0; owned && i < owned->size(); ++i) paths.push_back((*owned)[i]->getPath());
+    return owned ? paths : std::vector<std::string>{ "none" };
+}
+
 class AManager : public SimTest {
 protected:
     void SetUp() override {
@@ -64,25 +74,13 @@ protected:
 };
 
 TEST_F(AManager, FindsListsAndIndexesItsAdaptersLoggingWhatBluezCannotFind) {
-    std::unique_ptr<Adapter> byDefault(manager->defaultAdapter());
-    ASSERT_NE(byDefault, nullptr);
-    EXPECT_EQ(byDefault->getPath(), defaultPath);
+    EXPECT_EQ(pathOf(manager->defaultAdapter()), defaultPath);
     std::string second = sim::addAdapter("hci1", kSecondAddress);
-    std::unique_ptr<Adapter> found(manager->findAdapter(kSecondAddress));
-    ASSERT_NE(found, nullptr);
-    EXPECT_EQ(found->getPath(), second);
-    std::unique_ptr<AdapterList> adapters(manager->listAdapters());
-    ASSERT_NE(adapters, nullptr);
-    ASSERT_EQ(adapters->size(), 2u);
-    EXPECT_EQ((*adapters)[0]->getPath(), defaultPath);
-    EXPECT_EQ((*adapters)[1]->getPath(), second);
-    std::unique_ptr<Adapter> at1(manager->getAdapterByIndex(1));
-    ASSERT_NE(at1, nullptr);
-    EXPECT_EQ(at1->getPath(), second);
+    EXPECT_EQ(pathOf(manager->findAdapter(kSecondAddress)), second);
+    EXPECT_EQ(pathsOf(manager->listAdapters()), (std::vector<std::string>{ defaultPath, second }));
+    EXPECT_EQ(pathOf(manager->getAdapterByIndex(1)), second);
     sim::clearCallLog();
-    std::unique_ptr<Adapter> past(manager->getAdapterByIndex(2));  // the default one
-    ASSERT_NE(past, nullptr);
-    EXPECT_EQ(past->getPath(), defaultPath);
+    EXPECT_EQ(pathOf(manager->getAdapterByIndex(2)), defaultPath);  // past the end: the default one
     EXPECT_EQ(sim::logLinesWith("org.bluez.Manager."),
               (std::vector<std::string>{ "/ org.bluez.Manager.ListAdapters()", "/ org.bluez.Manager.DefaultAdapter()" }));
     EXPECT_FALSE(manager->hasError());
@@ -90,15 +88,12 @@ TEST_F(AManager, FindsListsAndIndexesItsAdaptersLoggingWhatBluezCannotFind) {
     EXPECT_EQ(manager->findAdapter("hci7"), nullptr);
     EXPECT_EQ(manager->getErrorNumber(), 11);
     EXPECT_EQ(sim::logLinesWith("org.bluez.Manager.FindAdapter(hci7)").size(), 1u);
-    adapters.reset(manager->listAdapters());
-    ASSERT_NE(adapters, nullptr);
+    EXPECT_EQ(pathsOf(manager->listAdapters()).size(), 2u);
     EXPECT_EQ(manager->getErrorNumber(), 11) << "the error of findAdapter was cleared";
     // Without adapters, the default that getAdapterByIndex falls back to does not exist.
     sim::removeAdapter("hci0");
     sim::removeAdapter("hci1");
-    adapters.reset(manager->listAdapters());
-    ASSERT_NE(adapters, nullptr);
-    EXPECT_TRUE(adapters->empty());
+    EXPECT_EQ(pathsOf(manager->listAdapters()), std::vector<std::string>{});
     EXPECT_EQ(manager->getAdapterByIndex(0), nullptr);
     EXPECT_EQ(manager->defaultAdapter(), nullptr);
     EXPECT_EQ(log.lines(), (std::vector<std::string>{ "manager.cpp:156 No such adapter", "manager.cpp:96 No such adapter",
@@ -150,9 +145,7 @@ TEST_F(AnAdapter, FindsCreatesAndListsItsDevicesLoggingWhyItCannotButAnUnknownAd
     ASSERT_TRUE(services != nullptr);
     ASSERT_EQ(services->size(), 1u);
     EXPECT_EQ(variantToString(services->front().second).compare(0, 5, "<?xml"), 0);
-    std::unique_ptr<Device> phone(adapter->createDevice(kPhone));
-    ASSERT_NE(phone, nullptr);
-    EXPECT_EQ(phone->getPath(), sim::devicePath(kPhone));
+    EXPECT_EQ(pathOf(adapter->createDevice(kPhone)), sim::devicePath(kPhone));
     LogCapture log;
     EXPECT_EQ(adapter->findDevice(kKeyboard, false), nullptr);
     EXPECT_EQ(adapter->getErrorNumber(), 11);
@@ -166,27 +159,18 @@ TEST_F(AnAdapter, FindsCreatesAndListsItsDevicesLoggingWhyItCannotButAnUnknownAd
                                                       "adapter.cpp:274 Host is down",
                                                       "adapter.cpp:274 Invalid arguments in method call" }));
     log.clear();
-    std::unique_ptr<DeviceList> devices(adapter->listDevices());
-    ASSERT_NE(devices, nullptr);
-    ASSERT_EQ(devices->size(), 2u);
-    std::vector<std::string> paths;
-    for (size_t i = 0; i < devices->size(); ++i) {
-        paths.push_back((*devices)[i]->getPath());
-        std::unique_ptr<Device> at(adapter->getDeviceByIndex(i));
-        ASSERT_NE(at, nullptr);
-        EXPECT_EQ(at->getPath(), paths.back());
-    }
+    std::vector<std::string> paths = pathsOf(adapter->listDevices());
+    EXPECT_EQ(paths, (std::vector<std::string>{ pathOf(adapter->getDeviceByIndex(0)),
+                                                pathOf(adapter->getDeviceByIndex(1)) }));
     std::sort(paths.begin(), paths.end());
-    EXPECT_EQ(paths, (std::vector<std::string>{ mouse->getPath(), phone->getPath() }));
+    EXPECT_EQ(paths, (std::vector<std::string>{ mouse->getPath(), sim::devicePath(kPhone) }));
     EXPECT_EQ(adapter->getDeviceByIndex(2), nullptr);
     EXPECT_FALSE(adapter->hasError());
     EXPECT_TRUE(log.lines().empty());
     ASSERT_TRUE(sim::start());  // the mouse alone again: the phone's link keeps it a while
     ASSERT_EQ(adapter->removeDevice(mouse->getPath()), 0);
     ASSERT_TRUE(sim::waitForLogLine("RemoveDevice"));
-    devices.reset(adapter->listDevices());
-    ASSERT_NE(devices, nullptr);
-    EXPECT_TRUE(devices->empty());
+    EXPECT_EQ(pathsOf(adapter->listDevices()), std::vector<std::string>{});
     EXPECT_EQ(adapter->getDeviceByIndex(0), nullptr);
 }
 
@@ -211,17 +195,15 @@ TEST_F(AnAdapter, PrintsItsSignalsThroughTheDefaultHandlersBesideOthers) {
         << out;
     EXPECT_FALSE(printed(out, std::string(kFarLaptop) + " was found")) << out;
     EXPECT_TRUE(printed(out, std::string(kPhone) + " was disappeared in " + path + "\n")) << out;
-    std::unique_ptr<Device> phone;
-    const std::string mouse = sim::devicePath(kMouse);
+    const std::string mouse = sim::devicePath(kMouse), phone = sim::devicePath(kPhone);
     out = printedUntil(1, [&] {
         adapter->stopDiscovery();
         sim::setInRange("hci0", kPhone, true);  // the simulator's Reset keeps the range
-        phone.reset(adapter->createDevice(kPhone));
+        EXPECT_EQ(pathOf(adapter->createDevice(kPhone)), phone);
         adapter->removeDevice(mouse.c_str());
         adapter->setProperty("Name", Variant(std::string("renamed")));
     });
-    ASSERT_NE(phone, nullptr);
-    EXPECT_TRUE(printed(out, phone->getPath() + std::string(" was created by ") + path + "\n")) << out;
+    EXPECT_TRUE(printed(out, phone + " was created by " + path + "\n")) << out;
     EXPECT_TRUE(printed(out, mouse + " was removed by " + path + "\n")) << out;
     EXPECT_TRUE(printed(out, "Name was changed in " + path + " with renamed\n")) << out;
 }
@@ -234,14 +216,14 @@ const char kHciconfig[] = "/usr/bin/hciconfig";
 TEST(AnAdaptersProperties, EndWithTheHciVersionThatHciconfigPrints) {
     BTBUS_IN_PRIVATE_NAMESPACE();
     std::string why;
-    ASSERT_TRUE(btbus_test::overlay("/usr/bin", why)) << why;
+    ASSERT_TRUE(overlay("/usr/bin", why)) << why;
     ASSERT_TRUE(sim::start());
     // Not the default adapter: the controller's name is the last component of its path.
     std::unique_ptr<Adapter> adapter(Adapter::getAdapter(sim::addAdapter("hci1", kSecondAddress).c_str()));
     ASSERT_NE(adapter, nullptr);
     std::unique_ptr<Dict> plain(adapter->BluezObject::getProperties());
     ASSERT_TRUE(plain != nullptr);
-    const std::string argsFile = btbus_test::scratchDir() + "/hciconfig-args";
+    const std::string argsFile = scratchDir() + "/hciconfig-args";
     const struct {
         const char* name;
         std::string script;   // the stand-in's, "" for none at all
@@ -268,16 +250,15 @@ TEST(AnAdaptersProperties, EndWithTheHciVersionThatHciconfigPrints) {
         LogCapture log;
         auto start = std::chrono::steady_clock::now();
         std::unique_ptr<Dict> properties(adapter->getProperties());
-        EXPECT_LT(std::chrono::steady_clock::now() - start, btbus_test::scaled(2s));
+        EXPECT_LT(std::chrono::steady_clock::now() - start, scaled(2s));
         ASSERT_TRUE(properties != nullptr);
         Dict expected(*plain);
         if (c.version) expected.push_back(Entry("HCIVersion", Variant(std::string(c.version))));
         EXPECT_TRUE(*properties == expected) << dictToString(*properties);
         EXPECT_EQ(log.lines(), c.version ? std::vector<std::string>{} : failed);
     }
-    std::ifstream args(argsFile);
     std::string line;
-    std::getline(args, line);
+    std::getline(std::ifstream(argsFile), line);
     EXPECT_EQ(line, "hci1 -a");
 }
 
@@ -361,16 +342,16 @@ TEST_F(AnAudioDevice, ReportsWhetherItsProfilesAreConnectedAndPrintsTheirAndTheD
     ASSERT_EQ(control->setConnectedHandler(nullptr), 0);
     ASSERT_EQ(device->setDisconnectRequestedHandler(nullptr), 0);
     ASSERT_EQ(device->setDisconnectRequestedHandler(&countNoArgument), 0);
-    bool connected = true;
-    ASSERT_EQ(sink->isConnected(connected), 0);
-    EXPECT_FALSE(connected);
-    connected = true;
-    ASSERT_EQ(control->isConnected(connected), 0);
-    EXPECT_FALSE(connected);
+    // 1 connected, 0 not, -1 when the query fails.
+    auto state = [](auto& profile) {
+        bool connected = true;
+        return profile->isConnected(connected) == 0 ? int(connected) : -1;
+    };
+    EXPECT_EQ(state(sink), 0);
+    EXPECT_EQ(state(control), 0);
     std::string out = printedUntil(1, [&] {
         EXPECT_EQ(sink->connect(), 0);
-        EXPECT_TRUE(waitUntil([&] { return sink->isConnected(connected) == 0 && connected; }));
-        EXPECT_TRUE(waitUntil([&] { return control->isConnected(connected) == 0 && connected; }));
+        EXPECT_TRUE(waitUntil([&] { return state(sink) == 1 && state(control) == 1; }));
         sim::setPlaying("hci0", kHeadset, true);
         sim::setPlaying("hci0", kHeadset, false);
         EXPECT_EQ(sink->disconnect(), 0);
@@ -439,7 +420,7 @@ protected:
 TEST_F(ABluetoothdInTrouble, ThatHangsEndsTheWaitsAtTheDefaultTimeOutAndServesAgainWhenItWakes) {
     for (auto waited : waitsWhile([] {})) {
         EXPECT_GE(waited, 24s);
-        EXPECT_LT(waited, btbus_test::scaled(35s));
+        EXPECT_LT(waited, scaled(35s));
     }
     int before = gFound;
     sim::freeze(false);
@@ -449,13 +430,12 @@ TEST_F(ABluetoothdInTrouble, ThatHangsEndsTheWaitsAtTheDefaultTimeOutAndServesAg
 
 TEST_F(ABluetoothdInTrouble, ThatDiesEndsTheWaitsAtOnceFailsWhatFollowsCleanlyAndANewOneServes) {
     std::unique_ptr<Device> mouse(adapter->findDevice(kMouse, true));
-    ASSERT_NE(mouse, nullptr);
     std::unique_ptr<Manager> manager(Manager::getManager());
-    std::unique_ptr<AudioSink> sink(AudioSink::getAudioSink(mouse->getPath()));
-    ASSERT_TRUE(manager && sink);
+    std::unique_ptr<AudioSink> sink(AudioSink::getAudioSink(sim::devicePath(kMouse).c_str()));
+    ASSERT_TRUE(mouse && manager && sink);
     LogCapture log;
     for (auto waited : waitsWhile([] { sim::kill(); }))
-        EXPECT_LT(waited, btbus_test::scaled(5s)) << "waited for a time-out instead of the bus's notice";
+        EXPECT_LT(waited, scaled(5s)) << "waited for a time-out instead of the bus's notice";
     EXPECT_EQ(log.count("adapter.cpp:312 " + adapter->getErrorMessage()), 1u);
     log.clear();
     // Asking the bus daemon whether bluetoothd runs succeeds: nothing to log.
