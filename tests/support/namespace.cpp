@@ -1,7 +1,6 @@
 #include "support/namespace.h"
 
 #include <cstdlib>
-#include <iterator>
 #include <set>
 #include <vector>
 
@@ -10,39 +9,31 @@
 #include <unistd.h>
 
 #include "support/process.h"
-#include "support/sim.h"
 
 namespace btbus_test {
 
 namespace {
 
-const char kRole[] = "private-namespace";
-const char* const kUnshare[] = { "unshare", "-m", "-p", "-f", "--mount-proc" };
-
-std::string currentTest() {
-    const ::testing::TestInfo* test = ::testing::UnitTest::GetInstance()->current_test_info();
-    return std::string(test->test_suite_name()) + "." + test->name();
+bool failed(std::string& why, const std::string& what) {
+    why = what;
+    return false;
 }
 
-bool tmpfs(const std::string& directory, std::string& why) {
-    if (mount("tmpfs", directory.c_str(), "tmpfs", 0, "size=16m") == 0) return true;
-    why = "cannot mount a tmpfs on " + directory;
-    return false;
+bool tmpfs(const std::string& directory, std::string& why, const char* options = "size=16m") {
+    return mount("tmpfs", directory.c_str(), "tmpfs", 0, options) == 0 || failed(why, "cannot mount a tmpfs on " + directory);
 }
 
 }  // namespace
 
 bool inPrivateNamespace(std::string& skip) {
-    if (childRole() == kRole) return true;
+    const std::vector<std::string> unshare = { "unshare", "-m", "-p", "-f", "--mount-proc" };
     std::string probe;
-    for (const char* word : kUnshare) probe += std::string(word) + " ";
-    if (geteuid() != 0 || std::system((probe + "true >/dev/null 2>&1").c_str()) != 0) {
+    for (const std::string& word : unshare) probe += word + " ";
+    if (childRole().empty() && (geteuid() != 0 || std::system((probe + "true >/dev/null 2>&1").c_str()) != 0)) {
         skip = "needs root and '" + probe + "' to keep the host's /proc, /tmp, /etc and /usr out of reach";
         return false;
     }
-    EXPECT_EQ(runInChild(currentTest(), kRole, std::vector<std::string>(std::begin(kUnshare), std::end(kUnshare))), 0)
-        << "the test failed in its private namespace (its output is above)";
-    return false;
+    return inOwnProcess(unshare);
 }
 
 bool overlay(const std::string& directory, std::string& why) {
@@ -55,9 +46,8 @@ bool overlay(const std::string& directory, std::string& why) {
     mkdir((base + "/upper").c_str(), 0755);
     mkdir((base + "/work").c_str(), 0755);
     std::string options = "lowerdir=" + directory + ",upperdir=" + base + "/upper,workdir=" + base + "/work";
-    if (mount("overlay", directory.c_str(), "overlay", 0, options.c_str()) == 0) return true;
-    why = "cannot mount an overlay on " + directory;
-    return false;
+    return mount("overlay", directory.c_str(), "overlay", 0, options.c_str()) == 0 ||
+           failed(why, "cannot mount an overlay on " + directory);
 }
 
 bool privateTmp(const std::vector<std::string>& keep, std::string& why) {
@@ -71,21 +61,15 @@ bool privateTmp(const std::vector<std::string>& keep, std::string& why) {
     // Put together aside, then moved onto /tmp.
     std::string fresh = scratchDir() + "/private-tmp";
     mkdir(fresh.c_str(), 0755);
-    if (mount("tmpfs", fresh.c_str(), "tmpfs", 0, "size=16m,mode=1777") != 0) {
-        why = "cannot mount a tmpfs on " + fresh;
-        return false;
-    }
+    if (!tmpfs(fresh, why, "size=16m,mode=1777")) return false;
     for (const std::string& tree : trees) {
         std::string at = fresh + tree.substr(4);
         mkdir(at.c_str(), 0755);
-        if (mount(tree.c_str(), at.c_str(), nullptr, MS_BIND, nullptr) != 0) {
-            why = "cannot bind " + tree + " into the private /tmp";
-            return false;
-        }
+        if (mount(tree.c_str(), at.c_str(), nullptr, MS_BIND, nullptr) != 0)
+            return failed(why, "cannot bind " + tree + " into the private /tmp");
     }
-    if (mount(fresh.c_str(), "/tmp", nullptr, MS_MOVE, nullptr) == 0) return true;
-    why = "cannot move the private tmpfs onto /tmp";
-    return false;
+    return mount(fresh.c_str(), "/tmp", nullptr, MS_MOVE, nullptr) == 0 ||
+           failed(why, "cannot move the private tmpfs onto /tmp");
 }
 
 bool privateSystemDirectories(std::string& why) {

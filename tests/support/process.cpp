@@ -3,13 +3,15 @@
 #include <algorithm>
 #include <cerrno>
 #include <csignal>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <iterator>
+#include <sstream>
 #include <thread>
 
 #include <fcntl.h>
 #include <poll.h>
-#include <spawn.h>
 #include <sys/prctl.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -39,35 +41,24 @@ std::string onPath(const std::string& argv0) {
     return argv0;
 }
 
-std::vector<std::string> emulator() {
-    std::vector<std::string> words;
-    const char* text = std::getenv("BTBUS_TEST_EMULATOR");
-    std::string word;
-    for (const char* c = text != nullptr ? text : ""; ; ++c) {
-        if (*c == ' ' || *c == '\0') {
-            if (!word.empty()) words.push_back(word);
-            word.clear();
-            if (*c == '\0') break;
-        } else {
-            word += *c;
-        }
-    }
-    return words;
+// argv as one line for /bin/sh, each word quoted.
+std::string shellLine(const std::vector<std::string>& argv) {
+    std::string line;
+    for (const std::string& word : argv) line += (line.empty() ? "'" : " '") + word + "'";
+    return line;
 }
 
 }  // namespace
 
 std::vector<std::string> targetCommand(std::vector<std::string> argv) {
-    std::vector<std::string> command = emulator();
+    const char* emulator = std::getenv("BTBUS_TEST_EMULATOR");
+    std::istringstream words(emulator != nullptr ? emulator : "");
+    std::vector<std::string> command{ std::istream_iterator<std::string>(words), {} };
     command.insert(command.end(), argv.begin(), argv.end());
     return command;
 }
 
-std::string targetShellCommand(const std::string& program) {
-    std::string line;
-    for (const std::string& word : targetCommand({ program })) line += (line.empty() ? "" : " ") + word;
-    return line;
-}
+std::string targetShellCommand(const std::string& program) { return shellLine(targetCommand({ program })); }
 
 std::chrono::milliseconds scaled(std::chrono::milliseconds duration) {
     const char* scale = std::getenv("BTBUS_TEST_TIME_SCALE");
@@ -103,9 +94,7 @@ pid_t spawn(const std::vector<std::string>& argv, int* stdoutFd) {
     int error = pid < 0 ? errno : 0;
     close(failure[1]);
     if (pid > 0 && read(failure[0], &error, sizeof error) == static_cast<ssize_t>(sizeof error))
-        waitpid(pid, nullptr, 0);
-    else if (pid > 0)
-        error = 0;
+        waitpid(pid, nullptr, 0);  // an exec that succeeds closes the pipe unwritten: error stays 0
     close(failure[0]);
     if (stdoutFd != nullptr) {
         close(out[1]);
@@ -177,14 +166,19 @@ bool waitForName(DBusBusType bus, const std::string& name, std::chrono::millisec
 }
 
 void requireDbusmock() {
-    static int status = -1;
-    if (status < 0) {
-        std::string command = std::string(kDebianPython) + " -c 'import dbusmock' 2>/dev/null";
-        status = std::system(command.c_str());
-    }
+    static const int status = std::system((std::string(kDebianPython) + " -c 'import dbusmock' 2>/dev/null").c_str());
     ASSERT_EQ(status, 0) << "python-dbusmock cannot be imported by " << kDebianPython
                          << ": install Debian's python3-dbusmock (apt-get install "
                             "python3-dbusmock), or run 'make check', which does";
+}
+
+std::string shell(const std::string& command) {
+    std::string output;
+    FILE* pipe = popen((command + " 2>&1").c_str(), "r");
+    char buffer[4096];
+    for (size_t n; pipe != nullptr && (n = fread(buffer, 1, sizeof buffer, pipe)) > 0;) output.append(buffer, n);
+    if (pipe != nullptr) pclose(pipe);
+    return output;
 }
 
 std::string scratchDir() {
@@ -202,32 +196,25 @@ std::string scratchDir() {
 int runInChild(const std::string& filter, const std::string& role,
                const std::vector<std::string>& wrapper) {
     char self[4096];
-    ssize_t length = readlink("/proc/self/exe", self, sizeof self - 1);
+    ssize_t length = readlink("/proc/self/exe", self, sizeof self);
     if (length <= 0) return -1;
-    self[length] = '\0';
     std::vector<std::string> argv = wrapper;
-    for (const std::string& word : targetCommand({ self })) argv.push_back(word);
-    argv.push_back("--gtest_filter=" + filter);
-    argv.push_back("--gtest_color=no");
-    std::vector<char*> args;
-    for (std::string& arg : argv) args.push_back(&arg[0]);
-    args.push_back(nullptr);
-    std::string roleVariable = "BTBUS_CHILD=" + role;
-    std::vector<char*> env;
-    for (char** e = environ; *e != nullptr; ++e)
-        if (std::strncmp(*e, "BTBUS_CHILD=", 12) != 0) env.push_back(*e);
-    env.push_back(&roleVariable[0]);
-    env.push_back(nullptr);
-    pid_t pid = -1;
-    if (posix_spawnp(&pid, args[0], nullptr, nullptr, args.data(), env.data()) != 0) return -1;
-    int status = 0;
-    if (waitpid(pid, &status, 0) != pid) return -1;
-    return status;
+    for (const std::string& word : targetCommand({ std::string(self, length), "--gtest_filter=" + filter, "--gtest_color=no" }))
+        argv.push_back(word);
+    return std::system(("BTBUS_CHILD='" + role + "' " + shellLine(argv)).c_str());
 }
 
 std::string childRole() {
     const char* role = std::getenv("BTBUS_CHILD");
     return role != nullptr ? role : "";
+}
+
+bool inOwnProcess(const std::vector<std::string>& wrapper) {
+    const ::testing::TestInfo* test = ::testing::UnitTest::GetInstance()->current_test_info();
+    std::string name = std::string(test->test_suite_name()) + "." + test->name();
+    if (childRole() == name) return true;
+    EXPECT_EQ(runInChild(name, name, wrapper), 0) << "the test failed in its own process (its output is above)";
+    return false;
 }
 
 }  // namespace btbus_test

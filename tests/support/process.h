@@ -52,6 +52,9 @@ bool waitForName(DBusBusType bus, const std::string& name,
 // imported by /usr/bin/python3.
 void requireDbusmock();
 
+// What command, a line for /bin/sh, prints on its standard output and error.
+std::string shell(const std::string& command);
+
 // A directory for this test binary's files under the build tree's test-tmp.
 std::string scratchDir();
 
@@ -63,7 +66,14 @@ int runInChild(const std::string& filter, const std::string& role,
                const std::vector<std::string>& wrapper = {});
 // The role this process was started with by runInChild, "" in the parent.
 std::string childRole();
+// Whether this process runs the current test in a child of its own (its role:
+// the test's name). In the parent it runs the test so, behind wrapper, expects
+// it to pass and returns false.
+bool inOwnProcess(const std::vector<std::string>& wrapper = {});
 
 }  // namespace btbus_test
+
+// The rest of the test runs in a fresh process of its own (see inOwnProcess).
+#define BTBUS_IN_OWN_PROCESS() do { if (!::btbus_test::inOwnProcess()) return; } while (0)
 
 #endif

@@ -14,6 +14,7 @@
 #include <bluetooth/btbus.h>
 
 #include "core/dbus_holders.h"
+#include "core/decode.h"
 #include "support/log_capture.h"
 #include "support/private_buses.h"
 #include "support/process.h"
@@ -53,15 +54,12 @@ Answer callScanner(const char* method, const std::string& argument, bool wait = 
     dbus_connection_unref(connection);
     Answer answer{ {}, error.name(), error.text() };
     DBusMessageIter args, array, entry;
-    if (reply && dbus_message_iter_init(reply.get(), &args) && dbus_message_iter_get_arg_type(&args) == DBUS_TYPE_ARRAY)
-        for (dbus_message_iter_recurse(&args, &array); dbus_message_iter_get_arg_type(&array) != DBUS_TYPE_INVALID;
-             dbus_message_iter_next(&array)) {
-            const char *key = "", *value = "";
+    if (reply && dbus_message_iter_init(reply.get(), &args) && typeOf(args) == DBUS_TYPE_ARRAY)
+        for (dbus_message_iter_recurse(&args, &array); typeOf(array) != DBUS_TYPE_INVALID; dbus_message_iter_next(&array)) {
             dbus_message_iter_recurse(&array, &entry);
-            dbus_message_iter_get_basic(&entry, &key);
+            std::string key = readText(entry);
             dbus_message_iter_next(&entry);
-            dbus_message_iter_get_basic(&entry, &value);
-            answer.devices[key] = value;
+            answer.devices[key] = readText(entry);
         }
     return answer;
 }
@@ -80,21 +78,11 @@ void found(const std::string& adapterPath, const std::string& address, const std
     sim::emitSignal(adapterPath, "org.bluez.Adapter", "DeviceFound", "sa{sv}", "[\"" + address + "\", " + props + "]");
 }
 
-std::string shell(const std::string& command) {
-    std::string output;
-    FILE* pipe = popen((command + " 2>&1").c_str(), "r");
-    char buffer[4096];
-    for (size_t n; pipe != nullptr && (n = fread(buffer, 1, sizeof buffer, pipe)) > 0;) output.append(buffer, n);
-    if (pipe != nullptr) pclose(pipe);
-    return output;
-}
-
 // Scanner::listDevices's result, released as its caller must: the list and every Dict in it.
-typedef std::vector<std::pair<std::string, Dict*> > DeviceDicts;
 struct ReleaseDevices {
-    void operator()(DeviceDicts* devices) const { for (auto& device : *devices) delete device.second; delete devices; }
+    template <typename List> void operator()(List* devices) const { for (auto& device : *devices) delete device.second; delete devices; }
 };
-using Devices = std::unique_ptr<DeviceDicts, ReleaseDevices>;
+using Devices = std::unique_ptr<std::vector<std::pair<std::string, Dict*> >, ReleaseDevices>;
 
 // btbus-scanner as the session bus starts it on a test's first call; ended after each test.
 class AScanner : public SimTest {
@@ -289,10 +277,7 @@ TEST_F(AScannerDaemon, SurvivesBadSignalsVanishingClientsAndAStormBesideEightCli
 
 // In a child of its own, whose session bus dies while a client asks.
 TEST(TheScannerDaemon, SaysWhatItDoesStartsDiscoveryOnItsAdaptersAndEndsWithoutACrashWhenItsBusDies) {
-    if (childRole() != "bus-dies") {
-        EXPECT_EQ(runInChild("TheScannerDaemon.*", "bus-dies"), 0);
-        return;
-    }
+    BTBUS_IN_OWN_PROCESS();
     std::string help = shell(targetShellCommand(BTBUS_SCANNER) + " --help");
     EXPECT_NE(help.find("com.quillmar.bluetooth on the session bus"), std::string::npos) << help;
     EXPECT_NE(shell(targetShellCommand(BTBUS_SCANNER) + " --bogus; echo status $?").find("status 2"), std::string::npos);
@@ -350,10 +335,7 @@ TEST(AServerObject, ClaimsItsNameAlsoBehindAnotherOwnerAndLogsWhyItCannot) {
 // addAdapterFounder starts discovery and counts down from 30 again, also for
 // an adapter that has a finder already.
 TEST(AScannerServer, AddsFoundersIgnoresASecondStartLoopAndQuitsWhenAskedFromAnotherThread) {
-    if (childRole() != "server") {
-        EXPECT_EQ(runInChild("AScannerServer.*", "server"), 0);
-        return;
-    }
+    BTBUS_IN_OWN_PROCESS();
     ASSERT_TRUE(sim::start());
     struct Peeking : ScannerServer {
         size_t foundersNow() { return founders->size(); }
