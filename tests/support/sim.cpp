@@ -2,12 +2,6 @@
 
 #include <csignal>
 #include <cstdlib>
-#include <cstring>
-#include <memory>
-
-#include <spawn.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <gtest/gtest.h>
 
@@ -15,10 +9,7 @@
 #include <bluetooth/remote_object.h>
 
 #include "core/call.h"
-#include "core/dbus_holders.h"
 #include "support/process.h"
-
-extern char** environ;
 
 namespace btbus_test {
 
@@ -47,11 +38,6 @@ public:
     }
 };
 
-void stopAtExit() {
-    if (gSim > 0) stop(gSim, SIGKILL);
-    gSim = -1;
-}
-
 // One control call; the reply is read by read (null: none awaited).
 template <typename Read, typename... A>
 bool control(const char* method, Read read, const A&... args) {
@@ -73,32 +59,24 @@ int noReply(RemoteObject&) { return 0; }
 
 namespace sim {
 
-bool running() { return gSim > 0 && nameHasOwner(DBUS_BUS_SYSTEM, "org.bluez"); }
-
 bool start() {
-    if (gSim <= 0) {
-        requireDbusmock();
-        if (::testing::Test::HasFatalFailure()) return false;
-        static bool registered = false;
-        if (!registered) {
-            registered = true;
-            ::testing::AddGlobalTestEnvironment(new SimEnvironment);
-            std::atexit(&stopAtExit);
-        }
-        // Short rounds and links, so that discovery and idle links show quickly.
-        gSim = spawn({ kDebianPython, "-m", "dbusmock", "--system", "--template",
-                       std::string(BTBUS_SOURCE_DIR) + "/tools/bluez4-sim/bluez4.py", "-p",
-                       "{\"round_seconds\": 0.3, \"idle_seconds\": 0.5}" });
-        if (gSim <= 0) return false;
-        if (!waitForName(DBUS_BUS_SYSTEM, "org.bluez")) {
-            ADD_FAILURE() << "bluez4-sim did not take org.bluez";
-            kill();
-            return false;
-        }
-    } else {
-        reset();  // a new one starts from the starting scene anyway
+    if (gSim > 0) return control("Reset", &noReply);  // a new one starts from the starting scene anyway
+    requireDbusmock();
+    if (::testing::Test::HasFatalFailure()) return false;
+    static bool registered = false;
+    if (!registered) {
+        registered = true;
+        ::testing::AddGlobalTestEnvironment(new SimEnvironment);
+        std::atexit([] { stop(gSim, SIGKILL); });  // also when a test exits early
     }
-    return !::testing::Test::HasFailure();
+    // Short rounds and links, so that discovery and idle links show quickly.
+    gSim = spawn({ kDebianPython, "-m", "dbusmock", "--system", "--template",
+                   std::string(BTBUS_SOURCE_DIR) + "/tools/bluez4-sim/bluez4.py", "-p",
+                   "{\"round_seconds\": 0.3, \"idle_seconds\": 0.5}" });
+    if (gSim > 0 && waitForName(DBUS_BUS_SYSTEM, "org.bluez")) return true;
+    ADD_FAILURE() << "bluez4-sim did not start and take org.bluez";
+    kill();
+    return false;
 }
 
 void kill() {
@@ -111,8 +89,6 @@ void kill() {
 void freeze(bool frozen) {
     if (gSim > 0) ::kill(gSim, frozen ? SIGSTOP : SIGCONT);
 }
-
-void reset() { control("Reset", &noReply); }
 
 std::string addAdapter(const std::string& name, const std::string& address) {
     ObjectPath path;
@@ -141,12 +117,6 @@ void emitSignal(const std::string& path, const std::string& interface, const std
             signature.c_str(), jsonArgs.c_str());
 }
 
-std::vector<std::string> callLog() {
-    std::vector<std::string> lines;
-    control("GetCallLog", [&](RemoteObject& o) { return o.getReplyValue(lines); });
-    return lines;
-}
-
 void clearCallLog() { control("ClearCallLog", &noReply); }
 
 std::string defaultAdapterPath() {
@@ -166,8 +136,9 @@ std::string devicePath(const std::string& address) {
 }
 
 std::vector<std::string> logLinesWith(const std::string& text) {
-    std::vector<std::string> found;
-    for (const std::string& line : callLog())
+    std::vector<std::string> lines, found;
+    control("GetCallLog", [&](RemoteObject& o) { return o.getReplyValue(lines); });
+    for (const std::string& line : lines)
         if (line.find(text) != std::string::npos) found.push_back(line);
     return found;
 }

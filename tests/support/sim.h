@@ -4,8 +4,6 @@
 #include <string>
 #include <vector>
 
-#include <sys/types.h>
-
 #include <gtest/gtest.h>
 
 namespace Bluetooth {
@@ -20,12 +18,11 @@ namespace btbus_test {
 namespace sim {
 
 // Starts the simulator unless it runs, and resets its scene and call log.
-// Call in every SetUp; returns false (with a failure added) when it cannot.
+// Call in every SetUp; returns whether it runs (false with a failure added).
 bool start();
 // Kills the simulator (SIGKILL: no goodbye on the bus) and waits until
 // "org.bluez" has no owner.
 void kill();
-bool running();
 // Freezes the simulator (SIGSTOP), as a hung bluetoothd: it neither answers
 // nor leaves the bus; or thaws it (SIGCONT).
 void freeze(bool frozen);
@@ -38,7 +35,6 @@ constexpr const char kFarLaptop[] = "00:24:7E:11:22:33";  // out of range
 constexpr const char kMouse[] = "00:1F:20:AB:CD:EF";      // paired: its device object exists
 
 // The simulator's control interface.
-void reset();
 std::string addAdapter(const std::string& name, const std::string& address);
 void removeAdapter(const std::string& name);
 void addDevice(const std::string& adapter, const std::string& json);
@@ -46,7 +42,6 @@ void setInRange(const std::string& adapter, const std::string& address, bool inR
 void setPlaying(const std::string& adapter, const std::string& address, bool playing);
 void emitSignal(const std::string& path, const std::string& interface, const std::string& member,
                 const std::string& signature, const std::string& jsonArgs);
-std::vector<std::string> callLog();
 void clearCallLog();
 
 // The default adapter's path, asked of the simulator ("" on failure).
