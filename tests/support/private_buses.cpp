@@ -17,7 +17,6 @@ struct Bus {
     const char* kind;
     const char* variable;
     pid_t pid = -1;
-    std::string address;
 };
 
 Bus gBuses[2] = { { "system", "DBUS_SYSTEM_BUS_ADDRESS" }, { "session", "DBUS_SESSION_BUS_ADDRESS" } };
@@ -53,8 +52,6 @@ void stopBuses() {
             dbus_connection_set_exit_on_disconnect(shared, FALSE);
             dbus_connection_unref(shared);
         }
-    }
-    for (Bus& bus : gBuses) {
         stop(bus.pid);
         bus.pid = -1;
     }
@@ -69,10 +66,10 @@ void PrivateBuses::SetUp() {
                           "--print-address=1" },
                         &out);
         ASSERT_GT(bus.pid, 0) << "dbus-daemon is needed: apt-get install dbus-daemon";
-        bus.address = readLine(out, 10000ms);
+        std::string address = readLine(out, 10000ms);
         close(out);
-        ASSERT_FALSE(bus.address.empty()) << "the " << bus.kind << " dbus-daemon gave no address";
-        setenv(bus.variable, bus.address.c_str(), 1);
+        ASSERT_FALSE(address.empty()) << "the " << bus.kind << " dbus-daemon gave no address";
+        setenv(bus.variable, address.c_str(), 1);
     }
     std::atexit(&stopBuses);  // also when a test exits early
 }

@@ -1,8 +1,6 @@
 #ifndef BTBUS_TESTS_SUPPORT_PRIVATE_BUSES_H
 #define BTBUS_TESTS_SUPPORT_PRIVATE_BUSES_H
 
-#include <string>
-
 #include <gtest/gtest.h>
 
 namespace btbus_test {
