@@ -47,14 +47,9 @@ class LauncherTest(unittest.TestCase):
         pathlib.Path(scratch, 'org.btbus.Activated.service').write_text(SERVICE)
         launcher = Launcher('--service-dir', scratch)
         self.addCleanup(launcher.stop)
-        children = {c: pathlib.Path(f'/proc/{c}/comm').read_text().strip() for c in children_of(launcher.proc.pid)}
-        self.assertEqual(sorted(children.values()), ['dbus-daemon', 'dbus-daemon', 'python3'])
-        simulator = [pid for pid, command in children.items() if command == 'python3'][0]
-        # What it printed, read by a shell, takes a program to bluetoothd.
-        out = subprocess.run(['sh', '-c', '. "$0" && exec gdbus call --system --dest org.bluez --object-path / '
-                              '--method org.bluez.Manager.DefaultAdapter', launcher.env_file],
-                             env={'PATH': '/usr/bin:/bin'}, capture_output=True, text=True, timeout=10, check=True)
-        self.assertEqual(out.stdout, f"(objectpath '/org/bluez/{simulator}/hci0',)\n")
+        children = children_of(launcher.proc.pid)
+        self.assertEqual(sorted(pathlib.Path(f'/proc/{c}/comm').read_text().strip() for c in children),
+                         ['dbus-daemon', 'dbus-daemon', 'python3'])
         session = dbus.bus.BusConnection(launcher.env['DBUS_SESSION_BUS_ADDRESS'])
         self.addCleanup(session.close)
         session.start_service_by_name('org.btbus.Activated')
