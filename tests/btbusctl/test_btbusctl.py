@@ -126,13 +126,10 @@ class BtbusctlTest(SimTestCase):
                  (['restart-daemon'], 1, 'no adapter is attached')]
         scratch = tempfile.mkdtemp()
         self.addCleanup(os.rmdir, scratch)
-
-        def in_private_mounts(commands):
-            commands = [c if c[0] == 'cat' else [*BTBUSCTL, *c] for c in commands]
-            out = subprocess.run([IN_PRIVATE_MOUNTS, scratch, '/usr/bin/python3', '-c', RUNNER, json.dumps(commands)],
-                                 env=self.launcher.env, capture_output=True, text=True, timeout=60, check=True).stdout
-            return json.loads(out)
-        self.check(cases, in_private_mounts([args for args, _, _ in cases]))
+        commands = [args if args[0] == 'cat' else [*BTBUSCTL, *args] for args, _, _ in cases]
+        out = subprocess.run([IN_PRIVATE_MOUNTS, scratch, '/usr/bin/python3', '-c', RUNNER, json.dumps(commands)],
+                             env=self.launcher.env, capture_output=True, text=True, timeout=60, check=True).stdout
+        self.check(cases, json.loads(out))
         self.assertFalse(os.path.exists(file))
 
     def test_human_output_help_version_and_a_missing_bus_or_daemon(self):

@@ -34,11 +34,10 @@ void onFound(RemoteObject*, const char*, const Dict* properties) {
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     static RemoteObject adapter("org.bluez", "/org/bluez/1/hci0", "org.bluez.Adapter", DBUS_BUS_SYSTEM);
-    static bool listening = [] {  // no bus to ask for a match rule: straight into the list
+    [[maybe_unused]] static bool listening = [] {  // no bus to ask for a match rule: straight into the list
         RemoteObject::signalHandlerVectorStringDict.push_back({ &adapter, "DeviceFound", &onFound });
         return true;
     }();
-    (void)listening;
     return fuzz::withMessage(data, size, [](DBusMessage* message) {
         RemoteObject::signalHandlerDispatcherStringDict(&adapter, message);
     });

@@ -17,13 +17,12 @@ namespace fuzz {
 
 // Before main, so before any object: buses that cannot be reached (a connection
 // fails at once, never reaching the host's), and log lines that go nowhere.
-inline bool offline() {
+static const bool kOffline = [] {
     setenv("DBUS_SYSTEM_BUS_ADDRESS", "unix:path=/nonexistent/btbus-fuzz", 1);
     setenv("DBUS_SESSION_BUS_ADDRESS", "unix:path=/nonexistent/btbus-fuzz", 1);
     Bluetooth::internal::setLogSink([](const char*) {});
     return true;
-}
-static const bool kOffline = offline();
+}();
 
 // Gives use the message that data holds, if any. The body's length is taken from the
 // input's size: a mutation elsewhere still reaches libdbus's checks and the decoders.

@@ -25,7 +25,7 @@ void onConnected(RemoteObject* object) { gTouched += object != 0; }
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     static RemoteObject adapter("org.bluez", "/org/bluez/1/hci0", "org.bluez.Adapter", DBUS_BUS_SYSTEM);
     static RemoteObject sink("org.bluez", "/org/bluez/1/hci0/dev_00", "org.bluez.AudioSink", DBUS_BUS_SYSTEM);
-    static bool listening = [] {  // no bus to ask for match rules: straight into the lists
+    [[maybe_unused]] static bool listening = [] {  // no bus to ask for match rules: straight into the lists
         RemoteObject::signalHandlerVectorObjectPath.push_back({ &adapter, "DeviceCreated", &onPath });
         RemoteObject::signalHandlerVectorString.push_back({ &adapter, "DeviceDisappeared", &onText });
         RemoteObject::signalHandlerVectorStringVariant.push_back({ &adapter, "PropertyChanged", &onChange });
@@ -33,7 +33,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
         RemoteObject::signalHandlerVectorNoArgument.push_back({ &sink, "Connected", &onConnected });
         return true;
     }();
-    (void)listening;
     return fuzz::withMessage(data, size, [](DBusMessage* message) {
         RemoteObject::signalHandlerDispatcherObjectPath(&adapter, message);
         RemoteObject::signalHandlerDispatcherStringVariant(&adapter, message);

@@ -31,9 +31,8 @@ Model& modelEntry(const std::string& text, Model& entries) {
 // Every piece closed by a separator character, as entries; text after the last one is not read.
 Model modelDict(const std::string& text, const std::string& separators) {
     Model entries;
-    for (size_t at = 0, end; (end = text.find_first_of(separators, at)) != std::string::npos; at = end + 1) {
+    for (size_t at = 0, end; (end = text.find_first_of(separators, at)) != std::string::npos; at = end + 1)
         modelEntry(text.substr(at, end - at), entries);
-    }
     return entries;
 }
 

@@ -1,4 +1,4 @@
-// A program of a library user: built as C++11 against the installed headers.
+// A user's program, built as C++11 against the installed headers: btbus.h includes them all.
 #include <cstdlib>
 #include <iostream>
 #include <string>

@@ -22,9 +22,9 @@ scan_through_installed_scanner() {
     kill $sim
     wait $sim || true
     trap - EXIT
-    if pgrep -f "$1/bin/btbus-scanner" >/dev/null; then
+    if left=$(pgrep -f "$1/bin/btbus-scanner"); then
         echo "the activated btbus-scanner outlived its session bus"
-        pkill -f "$1/bin/btbus-scanner"
+        kill $left
         exit 1
     fi
 }

@@ -1,15 +1,11 @@
 #!/bin/sh
 # Builds the Debian packages from a copy of the tree with the standard tools,
 # checks them with lintian, unpacks them into a scratch root (nothing is
-# installed on the host) and runs what they hold from there: btbusctl and the
-# btbus-scanner that the session bus starts, against the packaged bluez4-sim;
-# then a user's program built against the packaged -dev files, through
-# pkg-config and through CMake.
+# installed on the host) and runs the checks of installed.sh there: the
+# packaged programs, and a user's program built against the packaged -dev.
 # Usage: package_test.sh SOURCE_DIR WORK_DIR CXX
 set -eu
-source=$1
-work=$2
-cxx=$3
+source=$1 work=$2 cxx=$3
 here=$(cd "$(dirname "$0")" && pwd)
 for tool in dpkg-buildpackage dh; do
     command -v $tool >/dev/null ||

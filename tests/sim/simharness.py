@@ -57,8 +57,8 @@ class Launcher:
             pathlib.Path(self.env_file).unlink(missing_ok=True)  # stopped once before
 
 
-def run_until(predicate, timeout=5.0):
-    """Runs the GLib main loop until predicate() holds; False on time-out."""
+def run_until(predicate, timeout=10.0):
+    """Runs the GLib main loop until predicate() holds; False if it did not by the deadline."""
     context, deadline = GLib.MainContext.default(), time.monotonic() + timeout
     while not predicate():
         if time.monotonic() > deadline:
@@ -109,10 +109,10 @@ class SimTestCase(unittest.TestCase):
         """Lets queued signals arrive."""
         run_until(lambda: False, seconds)
 
-    def wait_signal(self, member, path=None, timeout=5.0):
+    def wait_signal(self, member, path=None):
         """The arguments of the first such signal, once it has arrived."""
         found = lambda: [args for p, _i, m, args in self.signals if m == member and path in (None, p)]  # noqa: E731
-        self.assertTrue(run_until(found, timeout), f'no {member} signal')
+        self.assertTrue(run_until(found), f'no {member} signal')
         return found()[0]
 
     def device_path(self, address):

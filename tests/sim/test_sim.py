@@ -33,10 +33,6 @@ def children_of(pid):  # of its main thread, the only one of the launcher
     return [int(child) for child in pathlib.Path(f'/proc/{pid}/task/{pid}/children').read_text().split()]
 
 
-def command_of(pid):
-    return pathlib.Path(f'/proc/{pid}/comm').read_text().strip()
-
-
 def alive(pid):  # and no zombie
     try:
         return pathlib.Path(f'/proc/{pid}/stat').read_text().rsplit(')', 1)[1].split()[0] != 'Z'
@@ -52,13 +48,8 @@ class LauncherTest(unittest.TestCase):
         launcher = Launcher('--service-dir', scratch)
         self.addCleanup(launcher.stop)
         children = children_of(launcher.proc.pid)
-        self.assertEqual(sorted(map(command_of, children)), ['dbus-daemon', 'dbus-daemon', 'python3'])
-        simulator = [pid for pid in children if command_of(pid) == 'python3'][0]
-        # What it printed, read by a shell, takes a program to bluetoothd.
-        out = subprocess.run(['sh', '-c', '. "$0" && exec gdbus call --system --dest org.bluez --object-path / '
-                              '--method org.bluez.Manager.DefaultAdapter', launcher.env_file],
-                             env={'PATH': '/usr/bin:/bin'}, capture_output=True, text=True, timeout=10, check=True)
-        self.assertEqual(out.stdout, f"(objectpath '/org/bluez/{simulator}/hci0',)\n")
+        self.assertEqual(sorted(pathlib.Path(f'/proc/{c}/comm').read_text().strip() for c in children),
+                         ['dbus-daemon', 'dbus-daemon', 'python3'])
         session = dbus.bus.BusConnection(launcher.env['DBUS_SESSION_BUS_ADDRESS'])
         self.addCleanup(session.close)
         session.start_service_by_name('org.btbus.Activated')
@@ -122,7 +113,7 @@ class BluezTest(SimTestCase):
         done = []
         self.bus.call_async('org.bluez', path, iface, member, None, args, lambda *result: done.append((*result, None)),
                             lambda error: done.append((None, error)), timeout=30)
-        self.assertTrue(run_until(lambda: done, 10), f'no answer to {member}')
+        self.assertTrue(run_until(lambda: done), f'no answer to {member}')
         return done[0]
 
     def test_calls_in_turn_get_the_errors_bluez_names_or_succeed_sending_the_signals_they_should(self):
@@ -214,7 +205,7 @@ class BluezTest(SimTestCase):
 
         self.control('SetInRange', 'hci0', NEAR['address'], False)
         gone = ('DeviceDisappeared', NEAR['address'])
-        self.assertTrue(run_until(lambda: gone in self.discovery(), 4 * ROUND_SECONDS + 2))
+        self.assertTrue(run_until(lambda: gone in self.discovery()))
         events = self.discovery()
         at = events.index(gone)
         self.assertEqual(events[at - 1], OFF)  # at the end of a round without it
@@ -228,10 +219,10 @@ class BluezTest(SimTestCase):
         del self.signals[:]
         other = dbus.bus.BusConnection(self.launcher.env['DBUS_SYSTEM_BUS_ADDRESS'])
         other.call_blocking('org.bluez', self.adapter, ADAPTER, 'StartDiscovery', '', ())
-        self.assertTrue(run_until(lambda: self.discovery().count(quiet) >= 2, 3 * ROUND_SECONDS + 2))
+        self.assertTrue(run_until(lambda: self.discovery().count(quiet) >= 2))
         self.assert_error(E + 'Failed', self.adapter, ADAPTER, 'StopDiscovery')
         other.close()
-        self.assertTrue(run_until(lambda: not self.call(self.adapter, ADAPTER, 'GetProperties')['Discovering'], 3))
+        self.assertTrue(run_until(lambda: not self.call(self.adapter, ADAPTER, 'GetProperties')['Discovering']))
         self.drain(1.5 * ROUND_SECONDS)
         events = self.discovery()
         self.assertEqual(events, [ON, quiet, OFF] * events.count(quiet))
@@ -251,13 +242,14 @@ class BluezTest(SimTestCase):
                                                   capability)
                 self.assertEqual((path, failure and failure.get_dbus_name()),
                                  (None, E + error) if error else (self.device_path(address), None))
-                self.assertTrue(run_until(lambda: [c[0] for c in self.agent.calls] == [request, 'Release']),
-                                self.agent.calls)
+                # A failed pairing drops the device, after the Release: waited for too.
+                members = lambda: [s[2] for s in self.signals]  # noqa: E731
+                self.assertTrue(run_until(lambda: [c[0] for c in self.agent.calls] == [request, 'Release'] and
+                                          (not error or 'DeviceRemoved' in members())), (self.agent.calls, members()))
                 self.drain()
-                members, args = [s[2] for s in self.signals], [s[3] for s in self.signals]
-                self.assertEqual(members[0], 'DeviceCreated')
-                # A failed pairing drops the device.
-                self.assertEqual(('DeviceRemoved' in members, ['Paired', True] in args), (bool(error), not error))
+                self.assertEqual(members()[0], 'DeviceCreated')
+                self.assertEqual(('DeviceRemoved' in members(), ['Paired', True] in [s[3] for s in self.signals]),
+                                 (bool(error), not error))
 
     def test_incoming_requests_go_to_the_registered_agent_unless_the_device_is_trusted(self):
         self.assertEqual(self.control('StartIncomingPairing', 'hci0', PHONE), E + 'AgentNotAvailable')

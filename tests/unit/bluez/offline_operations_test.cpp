@@ -20,9 +20,7 @@ const char kAdapterPath[] = "/org/bluez/77/hci0";
 const char kDevicePath[] = "/org/bluez/77/hci0/dev_00_11_22_33_44_55";
 
 TEST(AProxyWithoutABus, FailsEveryOperationAndLogsItOnceAtItsOwnLine) {
-    const char* const wait = "No connection to the bus";
-    const char* const send = "Failed to send message";
-    const char* const null = "Parameter is null";
+    const std::string wait = "No connection to the bus", send = "Failed to send message", null = "Parameter is null";
     Agent unregistered;  // its path is still empty
     Manager manager;
     Adapter adapter(kAdapterPath);
@@ -93,9 +91,7 @@ template <typename List, typename Element>
 void expectOwnsElementsFrontToBackSkippingNull() {
     std::vector<std::string> deleted;
     List* list = new List;
-    list->push_back(new Tracked<Element>("/a", deleted));
-    list->push_back(nullptr);
-    list->push_back(new Tracked<Element>("/b", deleted));
+    list->insert(list->end(), { new Tracked<Element>("/a", deleted), nullptr, new Tracked<Element>("/b", deleted) });
     delete list;
     EXPECT_EQ(deleted, (std::vector<std::string>{ "/a", "/b" }));
 }
@@ -104,10 +100,6 @@ TEST(TheAdapterAndDeviceLists, DeleteTheirElementsFrontToBackSkippingNullOnes) {
     expectOwnsElementsFrontToBackSkippingNull<AdapterList, Adapter>();
     expectOwnsElementsFrontToBackSkippingNull<DeviceList, Device>();
 }
-
-}  // namespace
-
-namespace {
 
 TEST(AScannerServerWithoutBluetoothd, LogsThatItHasNoManagerAndIsNotReady) {
     LogCapture log;

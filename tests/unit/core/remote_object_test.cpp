@@ -15,10 +15,7 @@ namespace {
 class Probe : public RemoteObject {
 public:
     Probe() : RemoteObject("org.bluez", "/", "org.bluez.Manager", DBUS_BUS_SYSTEM) {}
-    void setError(int number, const std::string& text) {
-        errorNumber = number;
-        errorMessage = text;
-    }
+    void setError(int number, const std::string& text) { errorNumber = number; errorMessage = text; }
     DBusMessage* outgoing() const { return message; }
 };
 

@@ -32,8 +32,7 @@ std::string contentOf(const std::string& path) {
 
 TEST(AFifo, CarriesBytesOneWayAndReportsWhatGoesWrong) {
     std::string path = btbus_test::scratchDir() + "/fifo";
-    // No reader (its log line is checked with the auto-connect commands), but
-    // the pipe is created meanwhile.
+    // No reader (its log line is checked with the auto-connect commands), but the pipe is made.
     EXPECT_EQ(Fifo::getWriteFifo(path.c_str()), nullptr);
     struct stat info;
     ASSERT_EQ(stat(path.c_str(), &info), 0);
@@ -83,8 +82,7 @@ TEST(APidFile, LocksOutASecondProcessAndKeepsItsId) {
     std::string path = btbus_test::scratchDir() + "/daemon.pid";
     std::ofstream(path) << "123456789012\n";  // left by a process that died
     int held[2], release[2];
-    ASSERT_EQ(pipe(held), 0);
-    ASSERT_EQ(pipe(release), 0);
+    ASSERT_EQ(pipe(held) | pipe(release), 0);
     pid_t holder = fork();
     if (holder == 0) {  // the first instance: holds the lock until told, or until the test ends
         close(release[1]);
@@ -140,8 +138,7 @@ TEST(TheHciHelpers, TakeAddressesFromPathsAndFailCleanlyWithoutARadio) {
         EXPECT_EQ(address ? std::string(address.get()) : "<null>", row.address ? row.address : "<null>")
             << (row.path ? row.path : "<null>");
     }
-    // Each fails before or at the HCI socket (this machine has no radio); the
-    // buffer is left as it was.
+    // Each fails before or at the HCI socket (this machine has no radio), leaving the buffer as it was.
     const struct { const char* address; int length; } kRequests[] = {
         { nullptr, 16 }, { "00:11:22:33:44:55", 0 }, { "00:11:22:33:44:55", -1 }, { "00:11:22:33:44:55", 16 },
     };
