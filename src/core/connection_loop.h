@@ -34,7 +34,7 @@ public:
     static ConnectionLoop* of(DBusConnection* connection);
 
     enum End { kReplied, kTimedOut, kInterrupted, kClosed, kNotSent };
-    // What the notify of a waited-for call shares with the waiting thread.
+    // A thread waiting for the reply to its call.
     struct Waiter;
 
     // Sends message and waits for its reply, at most timeout (libdbus's
