@@ -285,11 +285,13 @@ TEST_F(APairing, WithoutAReceivingThreadIsAnsweredByTheThreadThatDispatches) {
     EXPECT_TRUE(waitUntil([] { return reached("Release") == 2; }));
     expectAnswersToPeers(adapter->getConnectionName(), agent);
     {
-        // A passkey that cannot be sent: no answer, logged once, not dispatched again and again.
+        // A passkey that cannot be sent: no answer, logged once, and the request is not dispatched
+        // again and again ahead of the next one.
         ASSERT_EQ(agent.setPasskeyValue("\xff\xfe"), 0);
         LogCapture log;
         EXPECT_EQ(callAsAPeer(adapter->getConnectionName(), agent.getPath(), "RequestPinCode", 1000, "o"),
                   "org.freedesktop.DBus.Error.NoReply");
+        EXPECT_EQ(callAsAPeer(adapter->getConnectionName(), agent.getPath(), "Release", 10000), "");  // the next one
         EXPECT_EQ(log.lines(), std::vector<std::string>{
             "agent.cpp:173 Failed to create reply message when handling request pin code message." });
     }
