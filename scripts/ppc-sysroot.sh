@@ -51,7 +51,7 @@ if [ -d "$sysroot" ]; then
     echo "$sysroot"
     exit 0
 fi
-say "building $sysroot (about two minutes on two cores)"
+say "building $sysroot (about five minutes on two cores)"
 mkdir -p "$work/src"
 # The upstream tarballs are what is built; a missing Debian diff is no matter.
 # shellcheck disable=SC2086
