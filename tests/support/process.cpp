@@ -44,7 +44,14 @@ std::string onPath(const std::string& argv0) {
 // argv as one line for /bin/sh, each word quoted.
 std::string shellLine(const std::vector<std::string>& argv) {
     std::string line;
-    for (const std::string& word : argv) line += (line.empty() ? "'" : " '") + word + "'";
+    for (const std::string& word : argv) {
+        line += line.empty() ? "'" : " '";
+        for (char c : word) {
+            if (c == '\'') line += "'\\'";  // ends the quote, an escaped quote, quotes again
+            line += c;
+        }
+        line += "'";
+    }
     return line;
 }
 
@@ -193,17 +200,6 @@ std::string scratchDir() {
     return dir;
 }
 
-int runInChild(const std::string& filter, const std::string& role,
-               const std::vector<std::string>& wrapper) {
-    char self[4096];
-    ssize_t length = readlink("/proc/self/exe", self, sizeof self);
-    if (length <= 0) return -1;
-    std::vector<std::string> argv = wrapper;
-    for (const std::string& word : targetCommand({ std::string(self, length), "--gtest_filter=" + filter, "--gtest_color=no" }))
-        argv.push_back(word);
-    return std::system(("BTBUS_CHILD='" + role + "' " + shellLine(argv)).c_str());
-}
-
 std::string childRole() {
     const char* role = std::getenv("BTBUS_CHILD");
     return role != nullptr ? role : "";
@@ -213,7 +209,14 @@ bool inOwnProcess(const std::vector<std::string>& wrapper) {
     const ::testing::TestInfo* test = ::testing::UnitTest::GetInstance()->current_test_info();
     std::string name = std::string(test->test_suite_name()) + "." + test->name();
     if (childRole() == name) return true;
-    EXPECT_EQ(runInChild(name, name, wrapper), 0) << "the test failed in its own process (its output is above)";
+    char self[4096];
+    ssize_t length = readlink("/proc/self/exe", self, sizeof self);
+    std::vector<std::string> argv = wrapper;
+    for (const std::string& word : targetCommand({ std::string(self, length > 0 ? length : 0),
+                                                   "--gtest_filter=" + name, "--gtest_color=no" }))
+        argv.push_back(word);
+    EXPECT_EQ(std::system(("BTBUS_CHILD=" + shellLine({ name }) + " " + shellLine(argv)).c_str()), 0)
+        << "the test failed in its own process (its output is above)";
     return false;
 }
 

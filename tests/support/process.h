@@ -58,17 +58,12 @@ std::string shell(const std::string& command);
 // A directory for this test binary's files under the build tree's test-tmp.
 std::string scratchDir();
 
-// Runs this test binary again with only the test named filter, with
-// BTBUS_CHILD=role in its environment, optionally behind a wrapper command
-// (e.g. {"unshare", "-m"}); returns the child's exit status (0: all passed).
-// The child starts its own private buses.
-int runInChild(const std::string& filter, const std::string& role,
-               const std::vector<std::string>& wrapper = {});
-// The role this process was started with by runInChild, "" in the parent.
+// The test this process was started to run by inOwnProcess, "" in the parent.
 std::string childRole();
-// Whether this process runs the current test in a child of its own (its role:
-// the test's name). In the parent it runs the test so, behind wrapper, expects
-// it to pass and returns false.
+// Whether this process runs the current test in a child of its own. In the
+// parent it runs this test binary again with only this test, behind wrapper
+// (e.g. {"unshare", "-m"}), expects it to pass and returns false. The child
+// starts its own private buses.
 bool inOwnProcess(const std::vector<std::string>& wrapper = {});
 
 }  // namespace btbus_test

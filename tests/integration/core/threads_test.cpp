@@ -265,10 +265,7 @@ void callAside(DBusConnection* aside, const char* member, const dbus_uint32_t* a
 // loop of its own keeps its signals, and may call the library inside its
 // dispatch (its own filter here, as dbus-glib's callbacks run).
 TEST(AProgramsOwnLoop, KeepsItsSignalsAndMayCallTheLibraryInsideItsDispatch) {
-    if (childRole() != "own-loop") {
-        EXPECT_EQ(runInChild("AProgramsOwnLoop.*", "own-loop"), 0);
-        return;
-    }
+    BTBUS_IN_OWN_PROCESS();
     startPeer();
     auto peer = peerObject();
     gCalls = 0;
@@ -299,10 +296,7 @@ TEST(AProgramsOwnLoop, KeepsItsSignalsAndMayCallTheLibraryInsideItsDispatch) {
 
 // Stopping is final for the process, so this runs in a child of its own.
 TEST(TheLoop, TakesOverACallMadeBeforeItStartedOutlivesItsObjectAndStopsForGood) {
-    if (childRole() != "stop") {
-        EXPECT_EQ(runInChild("TheLoop.*", "stop"), 0);
-        return;
-    }
+    BTBUS_IN_OWN_PROCESS();
     startPeer();
     auto peer = peerObject();
     auto owner = peerObject();
